@@ -1,0 +1,28 @@
+// The large text buffers of a pass. They are static, reused every pass and owned by the monitoring
+// thread; each holds text whose lines end in "\n\r".
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+inline constexpr size_t PRIMARY_DATA_BLOCK_SIZE = 1545056;
+inline constexpr int32_t OUTBUFFER_BUDGET = 1500000; // outbufferleft at the start of a pass
+inline constexpr size_t TOP_DATA_BLOCK_SIZE = 4096;
+inline constexpr size_t LS_DATA_BLOCK_SIZE = 3045056;
+inline constexpr size_t PS_DATA_BLOCK_SIZE = 250000;
+inline constexpr size_t LINE_SIZE = 4096;
+inline constexpr size_t WORD_COUNT = 50;
+inline constexpr size_t WORD_SIZE = 250;
+inline constexpr int32_t FILE_BUFFER_SIZE = 4591112;
+
+extern char primaryDataBlock[PRIMARY_DATA_BLOCK_SIZE]; // everything a pass gathers, in order
+extern int32_t outbufferleft; // bytes of primaryDataBlock still to be given out this pass
+extern int32_t pdboverflow;   // 1 once this pass has written its overflow line
+extern char topDataBlock[TOP_DATA_BLOCK_SIZE];    // error text of this pass's finding
+extern char topLogDataBlock[TOP_DATA_BLOCK_SIZE]; // its copy, which heads the event attachment
+extern char lsDataBlock[LS_DATA_BLOCK_SIZE];      // per-process descriptor listings
+extern char newPSDataBlock[PS_DATA_BLOCK_SIZE];   // this pass's process listing
+extern char oldPSDataBlock[PS_DATA_BLOCK_SIZE];   // the last pass's process listing
+extern char line[LINE_SIZE];                      // scratch for composed lines
+extern char words[WORD_COUNT][WORD_SIZE];         // scratch for split lines, one word a slot
+extern char file_buffer[FILE_BUFFER_SIZE];        // snapshot text staged for the next flush

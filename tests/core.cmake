@@ -1,0 +1,1 @@
+tarn_library_test(problem_reporting_test problem_reporting_test.cpp)

@@ -1,0 +1,74 @@
+// The recording platform: every platform service the library calls, defined inside the test
+// program. It keeps every trace line and every event with a copy of its attachment, serves data
+// files from a temporary directory, and fails any chosen call with a chosen return code.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "logsvc.h"
+
+namespace rec {
+
+enum class Call {
+    search_file_open,
+    random_read,
+    random_write,
+    query_file_size,
+    delete_file,
+    close_file,
+    microcode_log,
+    get_func_addr2,
+    release_func_addr,
+    ckptr,
+    malloc, // a failed allocation returns null; rc and crc are ignored
+    calloc,
+    count_
+};
+
+// Makes calls of `call` fail with `rc` and `*crc` = `crc`: the call after `skip` successful
+// ones, and the `times` - 1 after it (times < 0: every call from then on).
+void fail(Call call, uint32_t rc, uint32_t crc = 0, int skip = 0, int times = 1);
+// How many times `call` was made since the last reset.
+int calls(Call call);
+
+struct Event {
+    logsvc_record record; // as handed over; its attachment pointer is dangling afterwards
+    std::string attachment;
+    bool has_attachment;
+};
+struct Dump {
+    std::string title;
+    std::string bytes;
+};
+
+const std::vector<std::string> &traces();
+const std::vector<Dump> &dumps();
+const std::vector<Event> &events();
+// Index of the first trace line equal to `line` at or after `from`, or -1.
+int find_trace(std::string_view line, int from = 0);
+bool has_trace(std::string_view line);
+// Lines that begin with `prefix`, in order.
+std::vector<std::string> traces_starting(std::string_view prefix);
+void clear_traces();
+
+// The directory behind the data-file service, new and empty after each reset.
+const std::string &data_dir();
+void write_data_file(const std::string &name, std::string_view contents);
+std::string read_data_file(const std::string &name); // empty when missing
+bool data_file_exists(const std::string &name);
+int open_data_files();
+
+// What the module service resolves: `module`/`function` to `address`.
+void register_function(const std::string &module, const std::string &function, void *address);
+
+// Blocks of the debugging allocator still live, as "file:line" each.
+std::vector<std::string> live_allocations();
+
+// Back to a fresh platform: no traces, events, failures, registered functions, allocations
+// remembered; a new empty data directory.
+void reset();
+
+} // namespace rec
