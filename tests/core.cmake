@@ -1,1 +1,2 @@
 tarn_library_test(problem_reporting_test problem_reporting_test.cpp)
+tarn_library_test(control_block_test control_block_test.cpp support/private_ipc.cpp CONTROL_BLOCK)
