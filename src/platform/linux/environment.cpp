@@ -1,0 +1,68 @@
+#include "environment.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <sys/stat.h>
+
+namespace telv::environment {
+
+std::string text(const char *variable, const char *fallback) {
+    const char *value = std::getenv(variable);
+    return value != nullptr && value[0] != '\0' ? value : fallback;
+}
+
+uint64_t number(const char *variable, uint64_t fallback) {
+    const char *value = std::getenv(variable);
+    if (value == nullptr || value[0] == '\0') {
+        return fallback;
+    }
+    uint64_t result = 0;
+    for (const char *digit = value; *digit != '\0'; ++digit) {
+        if (*digit < '0' || *digit > '9' || result > (UINT64_MAX - 9) / 10) {
+            return fallback;
+        }
+        result = result * 10 + static_cast<uint64_t>(*digit - '0');
+    }
+    return result > 0 ? result : fallback;
+}
+
+int make_directories(const std::string &path) {
+    struct stat st;
+    if (::stat(path.c_str(), &st) == 0) {
+        return S_ISDIR(st.st_mode) ? 0 : ENOTDIR;
+    }
+    // Each prefix ending before a '/' is a parent; the whole path comes last.
+    int error = 0;
+    for (size_t end = path.find('/', 1); error == 0; end = path.find('/', end + 1)) {
+        std::string prefix = path.substr(0, end);
+        if (::mkdir(prefix.c_str(), 0755) != 0 && errno != EEXIST) {
+            error = errno;
+        }
+        if (end == std::string::npos) {
+            break;
+        }
+    }
+    if (error == 0 && (::stat(path.c_str(), &st) != 0 || !S_ISDIR(st.st_mode))) {
+        error = ENOTDIR;
+    }
+    return error;
+}
+
+std::string data_directory(int *error) {
+    std::string directory = text(DATA_DIR_VARIABLE, DEFAULT_DATA_DIR);
+    int made = make_directories(directory);
+    if (error != nullptr) {
+        *error = made;
+    }
+    return directory;
+}
+
+std::string file_in_data_directory(const char *variable, const char *default_name) {
+    const char *value = std::getenv(variable);
+    if (value != nullptr && value[0] != '\0') {
+        return value;
+    }
+    return data_directory() + "/" + default_name;
+}
+
+} // namespace telv::environment

@@ -1,0 +1,29 @@
+// Where the default platform keeps its files, and the knobs it takes from the environment. Every
+// value is read again at each use, so a host (or a test) moves the platform by changing its
+// environment; nothing is cached that could point at an old directory.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace telv::environment {
+
+inline constexpr const char *DATA_DIR_VARIABLE = "TELV_DATA_DIR";
+inline constexpr const char *DEFAULT_DATA_DIR = "/var/lib/telvzmnd";
+
+// The variable's value; `fallback` when it is unset or empty.
+std::string text(const char *variable, const char *fallback);
+// The variable as a whole decimal number above 0; `fallback` when it is unset, empty, not such a
+// number, or too large for 64 bits.
+uint64_t number(const char *variable, uint64_t fallback);
+
+// Creates `path` and its missing parents with mode 0755. 0, or the errno of the step that failed.
+int make_directories(const std::string &path);
+
+// The data directory, created when missing. Out: *error (0, or the errno of the creation).
+std::string data_directory(int *error = nullptr);
+
+// The file named by `variable`, or `default_name` inside the data directory when it is unset.
+std::string file_in_data_directory(const char *variable, const char *default_name);
+
+} // namespace telv::environment

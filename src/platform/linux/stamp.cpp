@@ -1,0 +1,26 @@
+#include "stamp.h"
+
+#include <cstdio>
+#include <ctime>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+namespace telv::stamp {
+
+UtcTime utc_now() {
+    UtcTime now{};
+    struct timespec clock;
+    ::clock_gettime(CLOCK_REALTIME, &clock);
+    struct tm parts;
+    ::gmtime_r(&clock.tv_sec, &parts);
+    std::snprintf(now.text, sizeof now.text, "%04d-%02d-%02dT%02d:%02d:%02d.%03ldZ",
+                  parts.tm_year + 1900, parts.tm_mon + 1, parts.tm_mday, parts.tm_hour,
+                  parts.tm_min, parts.tm_sec, clock.tv_nsec / 1000000);
+    return now;
+}
+
+long thread_id() {
+    return ::syscall(SYS_gettid);
+}
+
+} // namespace telv::stamp

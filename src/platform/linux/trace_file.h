@@ -1,0 +1,41 @@
+// The trace file of the default platform: one line per trace call, stamped with the time, the pid
+// and the thread, kept within a size bound by renaming a full file to "<name>.1".
+#pragma once
+
+#include <cstdarg>
+#include <cstddef>
+#include <cstdint>
+#include <string_view>
+
+namespace telv::trace {
+
+inline constexpr const char *FILE_VARIABLE = "TELV_TRACE_FILE";
+inline constexpr const char *DEFAULT_FILE_NAME = "telvzmnd.trace";
+inline constexpr const char *MAX_BYTES_VARIABLE = "TELV_TRACE_MAX_BYTES";
+inline constexpr uint64_t DEFAULT_MAX_BYTES = 8u << 20;
+inline constexpr const char *DETAIL_VARIABLE = "TELV_TRACE_DETAIL";
+// A line, stamp and line feed included, is cut to this many bytes.
+inline constexpr size_t MAX_LINE = 8192;
+inline constexpr size_t DUMP_BYTES_PER_ROW = 16;
+
+// A detail line: its eye-catcher (the first nine characters, "TARNSDAD:") has 'D' as the eighth.
+bool is_detail(std::string_view text);
+
+// Composes "<stamp><text>\n" into `out` (room bytes, room >= 1) and returns its length. Line ends
+// at the end of the text are dropped and those inside it written as "\n" and "\r", so that one
+// call is always one line; whatever does not fit is cut, the line feed always stays.
+size_t compose(char *out, size_t room, std::string_view stamp, std::string_view text);
+
+// One row of a dump: "00000010  41 42 ...  |AB..|", the offset and up to 16 bytes, in hex and as
+// text with '.' for anything unprintable. Returns its length (without a line end).
+size_t dump_row(char *out, size_t room, uint32_t offset, const unsigned char *bytes, size_t count);
+
+// Writes the formatted text as one trace line. The length of the text, or -1 when the trace file
+// could not be written.
+int vline(const char *format, va_list args);
+int line(const char *format, ...) __attribute__((format(printf, 1, 2)));
+
+// A title line, then the rows of the dump; 0, or -1 when the trace file could not be written.
+int dump(const char *title, const void *data, uint32_t length);
+
+} // namespace telv::trace
