@@ -102,10 +102,10 @@ TEST_F(ProblemReporting, ClassOfEverySystemReturnCode) {
         int events;
         uint16_t reason;
     } const table[] = {
-        {0, 1, 0xE081},  {1, 1, 0xE081},  {2, 1, 0xE081},  {3, 1, 0xE0F1},  {4, 1, 0xE081},
-        {5, 1, 0xE0F1},  {6, 1, 0xE0F1},  {7, 1, 0xE0F1},  {8, 0, 0},       {9, 1, 0xE0F1},
-        {10, 1, 0xE0F1}, {11, 1, 0xE0F1}, {12, 0, 0},      {13, 1, 0xE0F1}, {14, 1, 0xE0F1},
-        {0xFFFFFFFF, 1, 0xE0F1},
+        {0, 1, 0xE081}, {1, 1, 0xE081},  {2, 1, 0xE081},  {3, 1, 0xE0F1},
+        {4, 1, 0xE081}, {5, 1, 0xE0F1},  {6, 1, 0xE0F1},  {7, 1, 0xE0F1},
+        {8, 0, 0},      {9, 1, 0xE0F1},  {10, 1, 0xE0F1}, {11, 1, 0xE0F1},
+        {12, 0, 0},     {13, 1, 0xE0F1}, {14, 1, 0xE0F1}, {0xFFFFFFFF, 1, 0xE0F1},
     };
     for (const auto &row : table) {
         rec::reset();
