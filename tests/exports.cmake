@@ -1,0 +1,2 @@
+tarn_platform_test(exports_test SOURCES exports_test.cpp)
+add_dependencies(exports_test telvzmnd telvplatform)
