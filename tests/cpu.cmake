@@ -1,0 +1,1 @@
+tarn_library_test(process_listing_test process_listing_test.cpp support/fake_proc.cpp)
