@@ -82,13 +82,14 @@ std::set<std::string> names_after(const std::string &folder, const std::regex &p
 }
 
 std::set<std::string> marked_entry_points() {
-    static const std::regex marked(R"(TARN_EXPORT\s+[^;{(]*?\b(\w+)\s*\()");
+    // A line that starts with the mark, so that the macro's own definition does not count.
+    static const std::regex marked(R"((?:^|\n)[ \t]*TARN_EXPORT\s+[^;{(]*?\b(\w+)\s*\()");
     return names_after(env("TARN_SOURCE_DIR") + "/src/telvzmnd", marked, {".h", ".cpp"});
 }
 
 std::set<std::string> platform_services() {
     static const std::regex declared(
-        R"(\n[a-z_ ]*?[ *]((?:filesvc|tracesvc|logsvc|jcb|modsvc|memsvc|telvmemdebug)\w*)\s*\()");
+        R"(\b((?:filesvc|tracesvc|logsvc|jcb|modsvc|memsvc|telvmemdebug)\w*)\s*\()");
     return names_after(env("TARN_SOURCE_DIR") + "/src/platform", declared, {".h"});
 }
 
