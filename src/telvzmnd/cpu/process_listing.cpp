@@ -275,7 +275,10 @@ TARN_EXPORT int32_t query_number_of_cpus() {
         size_t size = 0;
         while (getline(&text, &size, cpuinfo.get()) != -1) {
             int number;
-            if (std::sscanf(text, "processor       : %d\n", &number) == 1) {
+            // The format begins with the word itself, so only a line that does can match; the
+            // test in front spares the scan of every other line of a long cpuinfo.
+            if (std::strncmp(text, "processor", sizeof "processor" - 1) == 0 &&
+                std::sscanf(text, "processor       : %d\n", &number) == 1) {
                 ++total;
                 tracesvc_trace("TARNCPUF: query_number_of_cpus: found number %d, new total: %d",
                                number, total);

@@ -1,0 +1,170 @@
+// The cost of one update of the process CPU accounting per process on this machine, at the
+// machine's own process count and with 2,000 and 5,000 extra idle processes, against a bare scan
+// that only opens, reads and closes each /proc/<pid>/stat once. Both scan the /proc directory.
+//
+// Every update must lie half a second after the one before or it is skipped; the clock-tick
+// source is therefore one that moves a second on at every call, so each iteration samples.
+// Tracing goes through the default platform into a trace file in a temporary data directory:
+// an update writes its entry and exit lines and one line per processor found, whatever the
+// process count; trace_line gives the cost of one such line.
+#include <benchmark/benchmark.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <dirent.h>
+#include <fcntl.h>
+#include <spawn.h>
+#include <string>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "cpu/process_listing.h"
+#include "tracesvc.h"
+
+extern char **environ;
+
+namespace {
+
+// Idle children that only make /proc longer; ended by their pids.
+class idle_processes {
+  public:
+    ~idle_processes() { resize(0); }
+
+    void resize(size_t count) {
+        while (pids_.size() > count) {
+            pid_t pid = pids_.back();
+            pids_.pop_back();
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+        const char *argv[] = {"sleep", "1000", nullptr};
+        while (pids_.size() < count) {
+            pid_t pid = 0;
+            int error = posix_spawn(&pid, "/bin/sleep", nullptr, nullptr, const_cast<char **>(argv),
+                                    environ);
+            if (error != 0) {
+                std::fprintf(stderr, "posix_spawn /bin/sleep: %s\n", std::strerror(error));
+                std::exit(1);
+            }
+            pids_.push_back(pid);
+        }
+    }
+
+  private:
+    std::vector<pid_t> pids_;
+};
+
+idle_processes idle;
+clock_t stepped_ticks;
+long tick_rate;
+
+clock_t one_second_later() {
+    stepped_ticks += tick_rate;
+    return stepped_ticks;
+}
+
+int pids_in_proc() {
+    int count = 0;
+    DIR *directory = opendir("/proc/");
+    for (const dirent *found = directory != nullptr ? readdir(directory) : nullptr;
+         found != nullptr; found = readdir(directory)) {
+        count += std::atoi(found->d_name) != 0 ? 1 : 0;
+    }
+    if (directory != nullptr) {
+        closedir(directory);
+    }
+    return count;
+}
+
+void report_per_pid(benchmark::State &state, int pids) {
+    state.counters["pids"] = pids;
+    state.counters["per_pid"] = benchmark::Counter(
+        pids, benchmark::Counter::kIsIterationInvariantRate | benchmark::Counter::kInvert);
+}
+
+void update_process_list_per_pid(benchmark::State &state) {
+    idle.resize(static_cast<size_t>(state.range(0)));
+    tick_rate = sysconf(_SC_CLK_TCK);
+    clock_tick_source = one_second_later;
+    reset_process_listing_state();
+    delete_process_list(&process_list);
+    std::memset(&process_list, 0, sizeof process_list);
+    update_process_list(&process_list); // every pid gets its entry before timing starts
+    for (auto _ : state) {
+        update_process_list(&process_list);
+    }
+    report_per_pid(state, process_list.number_of_entries - 1);
+    delete_process_list(&process_list);
+}
+
+void bare_stat_reads_per_pid(benchmark::State &state) {
+    idle.resize(static_cast<size_t>(state.range(0)));
+    char text[4096];
+    int pids = 0;
+    for (auto _ : state) {
+        pids = 0;
+        DIR *directory = opendir("/proc/");
+        for (const dirent *found = readdir(directory); found != nullptr;
+             found = readdir(directory)) {
+            int pid = std::atoi(found->d_name);
+            if (pid == 0) {
+                continue;
+            }
+            char path[64];
+            std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
+            int fd = open(path, O_RDONLY | O_CLOEXEC);
+            if (fd >= 0) {
+                benchmark::DoNotOptimize(read(fd, text, sizeof text - 1));
+                close(fd);
+            }
+            ++pids;
+        }
+        closedir(directory);
+    }
+    report_per_pid(state, pids);
+}
+
+// The processor count, read from /proc/cpuinfo at every update whatever the process count.
+void cpu_count(benchmark::State &state) {
+    for (auto _ : state) {
+        benchmark::DoNotOptimize(query_number_of_cpus());
+    }
+}
+
+// One trace line of the kind an update writes, for the share of tracing in an update.
+void trace_line(benchmark::State &state) {
+    for (auto _ : state) {
+        benchmark::DoNotOptimize(tracesvc_trace("TARNCPUF: ->update_process_list"));
+    }
+}
+
+} // namespace
+
+int main(int argc, char **argv) {
+    char data_dir[] = "/tmp/tarn-bench-XXXXXX";
+    if (std::getenv("TELV_DATA_DIR") == nullptr && mkdtemp(data_dir) != nullptr) {
+        setenv("TELV_DATA_DIR", data_dir, 1);
+    }
+    std::printf("processes on this machine before the benchmark: %d\n", pids_in_proc());
+    for (int extra : {0, 2000, 5000}) {
+        benchmark::RegisterBenchmark("update_process_list", update_process_list_per_pid)
+            ->Arg(extra)
+            ->ArgName("extra")
+            ->Unit(benchmark::kMicrosecond);
+        benchmark::RegisterBenchmark("bare_stat_reads", bare_stat_reads_per_pid)
+            ->Arg(extra)
+            ->ArgName("extra")
+            ->Unit(benchmark::kMicrosecond);
+    }
+    benchmark::RegisterBenchmark("query_number_of_cpus", cpu_count)->Unit(benchmark::kMicrosecond);
+    benchmark::RegisterBenchmark("trace_line", trace_line)->Unit(benchmark::kNanosecond);
+    benchmark::Initialize(&argc, argv);
+    benchmark::RunSpecifiedBenchmarks();
+    benchmark::Shutdown();
+    idle.resize(0);
+    return 0;
+}
