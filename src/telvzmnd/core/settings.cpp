@@ -53,4 +53,77 @@ int32_t num_threads_threshold;
 int32_t file_descriptors_percent_threshold;
 int32_t pp_file_descriptors_threshold;
 int32_t cpu_sleep_time_threshold;
+int32_t num_external_calls;
+int32_t num_log_thresholds;
+int32_t num_abort_thresholds;
 int32_t manualStart;
+
+namespace {
+
+// A trace text is handed to the printf-style trace service with exactly one int.
+consteval bool takes_one_int(std::string_view text) {
+    int conversions = 0;
+    for (size_t i = 0; i < text.size(); ++i) {
+        if (text[i] != '%') {
+            continue;
+        }
+        if (i + 1 >= text.size() || text[i + 1] != 'd') {
+            return false;
+        }
+        ++conversions;
+    }
+    return conversions == 1;
+}
+
+consteval bool table_is_sound() {
+    for (size_t i = 0; i < SETTING_COUNT; ++i) {
+        const setting &entry = SETTINGS[i];
+        if (!takes_one_int(entry.trace) || entry.keyword.empty()) {
+            return false;
+        }
+        if ((entry.value == nullptr) != (entry.handling == setting_handling::snapshot_size)) {
+            return false;
+        }
+        if ((entry.rule == nullptr) != (entry.check_order == 0)) {
+            return false;
+        }
+        for (size_t j = i + 1; j < SETTING_COUNT; ++j) {
+            if (SETTINGS[j].keyword == entry.keyword) {
+                return false;
+            }
+        }
+    }
+    return true;
+}
+static_assert(table_is_sound(),
+              "every setting needs one %d trace, its global and a unique keyword");
+
+} // namespace
+
+void reset_settings() {
+    for (const setting &entry : SETTINGS) {
+        if (entry.value != nullptr) {
+            *entry.value = 0;
+        } else {
+            *entry.unsigned_value = 0;
+        }
+    }
+    manualStart = 0;
+}
+
+TARN_EXPORT void tarn_settings_start_values(void) {
+    checking_interval = CHECKING_INTERVAL_DEFAULT;
+    snapshot_interval = 0;
+    trend_analysis_points = 0;
+    trend_analysis_num_increases = TREND_INCREASES_DEFAULT;
+    num_external_calls = 0;
+    num_log_thresholds = 0;
+    num_abort_thresholds = 0;
+}
+
+TARN_EXPORT const setting *tarn_settings_table(size_t *count) {
+    if (count != nullptr) {
+        *count = SETTING_COUNT;
+    }
+    return SETTINGS;
+}

@@ -1,0 +1,69 @@
+#include "core/validation.h"
+
+#include <array>
+
+namespace {
+
+inline constexpr size_t RULE_COUNT = [] {
+    size_t count = 0;
+    for (const setting &entry : SETTINGS) {
+        count += entry.rule != nullptr ? 1 : 0;
+    }
+    return count;
+}();
+
+// The settings with a rule, in the order of their check_order: that order is the monitor's order
+// of checking, which differs from the order of the keywords.
+consteval std::array<const setting *, RULE_COUNT> checking_sequence() {
+    std::array<const setting *, RULE_COUNT> sequence{};
+    for (const setting &entry : SETTINGS) {
+        if (entry.rule != nullptr) {
+            sequence[entry.check_order - 1] = &entry;
+        }
+    }
+    return sequence;
+}
+
+inline constexpr auto CHECKING_SEQUENCE = checking_sequence();
+
+consteval bool sequence_is_complete() {
+    for (const setting *entry : CHECKING_SEQUENCE) {
+        if (entry == nullptr) {
+            return false;
+        }
+    }
+    return true;
+}
+static_assert(sequence_is_complete(), "check_order must number the rules 1, 2, ... without gaps");
+
+} // namespace
+
+TARN_EXPORT int32_t tarn_run_requested(void) {
+    return actuallyRun == 1 ? 1 : 0;
+}
+
+bool setting_is_valid(const setting &entry) {
+    const setting_rule *rule = entry.rule;
+    if (rule == nullptr) {
+        return true;
+    }
+    int64_t value = setting_current(entry);
+    bool valid = value >= rule->low && value <= rule->high;
+    if (rule->cross == cross_check::not_below) {
+        valid = valid && value >= *rule->other;
+    } else if (rule->cross == cross_check::not_above) {
+        valid = valid && value <= *rule->other;
+    }
+    return valid;
+}
+
+TARN_EXPORT const setting *tarn_validate_settings(void) {
+    const setting *failed = nullptr;
+    for (const setting *entry : CHECKING_SEQUENCE) {
+        if (!setting_is_valid(*entry)) {
+            failed = entry;
+            break;
+        }
+    }
+    return failed;
+}
