@@ -1,8 +1,7 @@
-# One update of the process CPU accounting per process, against a bare scan of /proc. The
-# accounting's source is compiled in with the library's flags, over the default platform (the
-# recording one of the tests when the default platform is not built).
-add_executable(bench_process_listing process_listing.cpp
-               ${PROJECT_SOURCE_DIR}/src/telvzmnd/cpu/process_listing.cpp)
+# One update of the process CPU accounting per process, against a bare scan of /proc, over the
+# library's own objects and the default platform (the recording one of the tests when the default
+# platform is not built).
+add_executable(bench_process_listing process_listing.cpp $<TARGET_OBJECTS:telvzmnd_objects>)
 target_include_directories(bench_process_listing PRIVATE ${PROJECT_SOURCE_DIR}/src/telvzmnd
                                                          ${PROJECT_SOURCE_DIR}/src/platform)
 target_link_libraries(bench_process_listing PRIVATE benchmark::benchmark)
