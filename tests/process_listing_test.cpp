@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <malloc.h>
+
 #include <chrono>
 #include <csignal>
 #include <cstring>
@@ -373,6 +375,21 @@ TEST_F(ProcessListing, StatFileThatCannotBeOpenedIsTracedAndItsSlotKept) {
     EXPECT_EQ(process_list.sample_ticks[0], 2100);
 }
 
+TEST_F(ProcessListing, RootTooLongFailsLikeAnOpen) {
+    std::string long_root(5000, 'r');
+    proc_root = long_root.c_str();
+    tree->set_process(7, "init", 10, 4);
+    update_process_list(&process_list);
+    EXPECT_EQ(rec::traces(), (Traces{enter,
+                                     "TARNCPUF: query_number_of_cpus: error opening file "
+                                     "/proc/cpuinfo, errno: 36, File name too long",
+                                     leave}));
+    EXPECT_EQ(process_list.number_of_cpus, 1);
+    EXPECT_TRUE(chain_pids().empty());
+    EXPECT_EQ(process_list.current_sample, 1);
+    proc_root = tree->root().c_str();
+}
+
 TEST_F(ProcessListing, DirectoryEntriesThatAreNotPidsAreSkipped) {
     tree->add_other_directory("self");
     tree->add_other_directory("sys");
@@ -622,6 +639,9 @@ TEST_F(PrintedHistory, TableTextIsExact) {
               (Traces{"TARNCPUF: ->print_process_list", "TARNCPUF: <-print_process_list"}));
     EXPECT_EQ(result, static_cast<int>(std::strlen("TARNCPUF: <-print_process_list")));
     ASSERT_EQ(rec::live_allocations().size(), 3u);
+    // number_of_entries (3, the head included) x 493 bytes, as the allocator rounds it
+    EXPECT_GE(malloc_usable_size(text), 3u * 493u);
+    EXPECT_LT(malloc_usable_size(text), 3u * 493u + 32u);
     telvmemdebug_free(text, "test", 0);
 }
 

@@ -230,8 +230,8 @@ void emit_entry_line(table_text &table, const process_entry *entry) {
     int length =
         std::snprintf(text, sizeof text, "pid: %d, name: %.*s, priority: %d, nice: %d\n",
                       entry->pid, name_length, entry->process_name, entry->priority, entry->nice);
-    table.append(text, length < static_cast<int>(sizeof text) ? static_cast<size_t>(length)
-                                                              : sizeof text - 1);
+    size_t kept = length < 0 ? 0 : static_cast<size_t>(length);
+    table.append(text, kept < sizeof text ? kept : sizeof text - 1);
 }
 
 void emit_percentage_row(table_text &table, const process_list_header *list, const char *label,
