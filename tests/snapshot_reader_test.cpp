@@ -134,8 +134,8 @@ TEST(SnapshotReader, CarriageReturnLineFeedEndsAreReadToo) {
 
 TEST(SnapshotReader, TheFirstTimeStampOfABlockCounts) {
     std::string body = "Local date and time = not this one\n\r";
-    auto blocks =
-        read_snapshots(problem(body, "Local date and time = 31 December 1999 at 23:59:58 \n\r"));
+    std::string file = problem(body, "Local date and time = 31 December 1999 at 23:59:58 \n\r");
+    auto blocks = read_snapshots(file);
     ASSERT_EQ(blocks.size(), 1u);
     EXPECT_EQ(blocks[0].timestamp, "31 December 1999 at 23:59:58");
 }

@@ -2,6 +2,7 @@
 // any I/O, so that the same code serves the command, the tests and the fuzzer.
 #pragma once
 
+#include <concepts>
 #include <cstddef>
 #include <string>
 #include <string_view>
@@ -31,6 +32,10 @@ struct snapshot_block {
 // The blocks of `file`, in file order; together they cover every byte that is not a bare line end
 // between blocks. Never fails: text it cannot place becomes a cut, unterminated or stray block.
 std::vector<snapshot_block> read_snapshots(std::string_view file);
+// The blocks point into the text, so a string that dies with the call is refused.
+template <typename Text>
+requires std::same_as<Text, std::string> std::vector<snapshot_block> read_snapshots(Text &&file)
+= delete;
 
 // The text for a terminal: each "\n\r" line end (and a lone "\n") becomes "\n", and every other
 // control character but tab is shown as "\xHH", so that no byte of the file can drive the terminal.
