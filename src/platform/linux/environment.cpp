@@ -18,10 +18,11 @@ uint64_t number(const char *variable, uint64_t fallback) {
     }
     uint64_t result = 0;
     for (const char *digit = value; *digit != '\0'; ++digit) {
-        if (*digit < '0' || *digit > '9' || result > (UINT64_MAX - 9) / 10) {
+        auto value_of_digit = static_cast<uint64_t>(*digit - '0');
+        if (*digit < '0' || *digit > '9' || result > (UINT64_MAX - value_of_digit) / 10) {
             return fallback;
         }
-        result = result * 10 + static_cast<uint64_t>(*digit - '0');
+        result = result * 10 + value_of_digit;
     }
     return result > 0 ? result : fallback;
 }
