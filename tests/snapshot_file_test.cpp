@@ -266,6 +266,15 @@ TEST_F(SnapshotFile, ABufferSizeOfZeroNeverTouchesTheBuffer) {
     expect_event(only_event(), 0xE091, 0);
 }
 
+TEST_F(SnapshotFile, ANullBufferOnlyLetsTheLineThrough) {
+    std::vector<char> data = writable("alone");
+    tarn_save_data(data.data(), nullptr, FILE_BUFFER_SIZE, 0);
+    EXPECT_EQ(data[0], '\0');
+    // No staged text to write: that write counts as failed, and the line goes with it.
+    EXPECT_EQ(rec::read_data_file(FILE_NAME), "");
+    expect_event(only_event(), 0xE091, 0);
+}
+
 // ---- wrap path ----
 
 // The old file of the wrap example: 1,000 bytes, a plain opening at 0 (before the cut) and one

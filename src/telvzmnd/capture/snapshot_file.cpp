@@ -24,6 +24,7 @@ constexpr int64_t STAGING_ROOM = 10; // a line is staged only while more than th
 constexpr char month[13][10] = {"Error",   "January",  "February", "March",  "April",
                                 "May",     "June",     "July",     "August", "September",
                                 "October", "November", "December"};
+static_assert(sizeof month == 13 * 10);
 
 // What one flush works on: the line that did not fit (empty when it was staged), the staged text,
 // and `combined`, the length of both when the line came in.
@@ -34,6 +35,14 @@ struct flush_request {
     size_t capacity;
     uint64_t combined;
 };
+
+// The text staged so far; none at all when the caller gave no usable buffer.
+std::string_view staged_text(const flush_request &request) {
+    if (request.capacity == 0) {
+        return "";
+    }
+    return {request.buffer, strnlen(request.buffer, request.capacity)};
+}
 
 // A failure of the file service goes out with the result of the last open, OR 2, as the system
 // return code: after a failed open that result makes it a system-class report (0xE0F1).
@@ -58,7 +67,7 @@ bool write_text(filesvc_handle_t handle, const char *text, size_t length, uint32
     uint32_t info = 0;
     uint32_t rc = filesvc_random_write(handle, text, static_cast<uint32_t>(length), mode, 0,
                                        &written, &info, crc);
-    tracesvc_trace("TARNSDAD: byte_count = %d", written);
+    tracesvc_trace("TARNSDAD: byte_count = %d", static_cast<int>(written));
     return rc == 0 && written != 0;
 }
 
@@ -84,8 +93,8 @@ void append_to_file(const flush_request &request) {
         report(open_rc, crc, RC_SNAPSHOT_OPEN_APPEND);
         return;
     }
-    size_t staged = strnlen(request.buffer, request.capacity);
-    if (!write_text(handle, request.buffer, staged, FILESVC_APPEND, &crc)) {
+    std::string_view staged = staged_text(request);
+    if (!write_text(handle, staged.data(), staged.size(), FILESVC_APPEND, &crc)) {
         report(open_rc, crc, RC_SNAPSHOT_WRITE_STAGED);
     } else if (request.data[0] != '\0' && !append_oversized_line(handle, request, &crc)) {
         report(open_rc, crc, RC_SNAPSHOT_WRITE_LINE);
@@ -111,7 +120,7 @@ int64_t read_old_and_add_new(const flush_request &request, uint32_t file_size, c
     uint32_t info = 0;
     uint32_t rc = filesvc_random_read(handle, work, file_size, FILESVC_AT_OFFSET, 0, &bytes_read,
                                       &info, &crc);
-    tracesvc_trace("TARNSDAD: byte_count = %d", bytes_read);
+    tracesvc_trace("TARNSDAD: byte_count = %d", static_cast<int>(bytes_read));
     if (rc != 0 || bytes_read == 0) {
         // The file stays open here: a missing or empty file fails at this point whenever a wrap
         // is due, and the handle is left as it is.
@@ -124,9 +133,11 @@ int64_t read_old_and_add_new(const flush_request &request, uint32_t file_size, c
     }
     // The old text ends at its first NUL, as a string would: the new text follows it there.
     size_t length = strnlen(work, bytes_read);
-    size_t staged = strnlen(request.buffer, request.capacity);
-    std::memcpy(work + length, request.buffer, staged);
-    length += staged;
+    std::string_view staged = staged_text(request);
+    if (!staged.empty()) {
+        std::memcpy(work + length, staged.data(), staged.size());
+        length += staged.size();
+    }
     if (request.data[0] != '\0') {
         std::memcpy(work + length, request.data, request.in_len);
         std::memcpy(work + length + request.in_len, LINE_END, LINE_END_LENGTH);
@@ -190,8 +201,7 @@ void flush(const flush_request &request) {
     if (filesvc_query_file_size(SNAPSHOT_FILE_NAME, &file_size, &crc) != 0) {
         file_size = 0; // not there yet: the append creates it
     }
-    tracesvc_trace("TARNSDAD: buflen = %d (dec)",
-                   static_cast<int>(strnlen(request.buffer, request.capacity)));
+    tracesvc_trace("TARNSDAD: buflen = %d (dec)", static_cast<int>(staged_text(request).size()));
     // Summed in 64 bits: a file that would pass 4 GB wraps rather than grows.
     if (file_size + request.combined >= max_snapshot_file_size) {
         wrap_file(request, file_size);
@@ -224,7 +234,7 @@ TARN_EXPORT void tarn_save_data(char *data, char *buffer, int32_t buffer_size, i
     size_t in_len = std::strlen(data);
     size_t buf_len = capacity != 0 ? strnlen(buffer, capacity) : 0;
     uint64_t combined = in_len + buf_len;
-    bool staged = static_cast<int64_t>(combined) + STAGING_ROOM < buffer_size;
+    bool staged = static_cast<int64_t>(combined) + STAGING_ROOM < static_cast<int64_t>(capacity);
     if (staged) {
         std::memcpy(buffer + buf_len, data, in_len);
         std::memcpy(buffer + buf_len + in_len, LINE_END, LINE_END_LENGTH + 1);
