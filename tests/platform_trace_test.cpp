@@ -277,6 +277,8 @@ TEST_F(PlatformTrace, LinesOfManyThreadsNeverInterleave) {
 TEST_F(PlatformTrace, ProcessesSharingTheFileKeepWholeLinesAndTheBound) {
     set_variable("TELV_TRACE_MAX_BYTES", "4000");
     constexpr int LINES = 300;
+    // The trace file is already open when the child is made, as in a host that spawns.
+    tracesvc_trace("TARNPRCF: parent line %d", LINES);
     pid_t child = ::fork();
     ASSERT_GE(child, 0);
     if (child == 0) {

@@ -62,36 +62,32 @@ std::string library_name(const char *module) {
 
 uint32_t resolve(const char *module, const char *function, void **address, void **handle,
                  uint32_t *crc) {
-    if (address == nullptr || handle == nullptr) {
-        return finish(crc, EINVAL);
-    }
-    *address = nullptr;
-    *handle = nullptr;
-    if (!valid_module(module) || function == nullptr || function[0] == '\0') {
-        return finish(crc, EINVAL);
-    }
-    std::string library = library_name(module);
-    void *opened = open_module(library);
-    if (opened == nullptr) {
+    int error = 0;
+    void *opened = nullptr;
+    void *found = nullptr;
+    if (address == nullptr || handle == nullptr || !valid_module(module) || function == nullptr ||
+        function[0] == '\0') {
+        error = EINVAL;
+    } else if ((opened = open_module(library_name(module))) == nullptr) {
         const char *why = ::dlerror();
         trace::line("TELVMODF: module %s not loaded: %s", module, why != nullptr ? why : "?");
-        return finish(crc, ELIBACC);
-    }
-    ::dlerror();
-    void *found = ::dlsym(opened, function);
-    if (found == nullptr) {
+        error = ELIBACC;
+    } else if ((found = ::dlsym(opened, function)) == nullptr) {
         trace::line("TELVMODF: function %s not found in module %s", function, module);
         ::dlclose(opened);
-        return finish(crc, ENOENT);
-    }
-    {
+        error = ENOENT;
+    } else {
         Held &h = held();
         std::lock_guard guard(h.lock);
         h.handles[opened]++;
     }
-    *address = found;
-    *handle = opened;
-    return finish(crc, 0);
+    if (address != nullptr) {
+        *address = error == 0 ? found : nullptr;
+    }
+    if (handle != nullptr) {
+        *handle = error == 0 ? opened : nullptr;
+    }
+    return finish(crc, error);
 }
 
 uint32_t release(const char *function, void *handle, uint32_t *crc) {

@@ -24,6 +24,7 @@ struct Sink {
     std::mutex lock;
     std::string path;
     int fd = -1;
+    pid_t owner = 0; // a forked child opens its own: flock is shared with the opener's description
     dev_t device = 0;
     ino_t inode = 0;
 };
@@ -45,6 +46,7 @@ bool open_sink(Sink &s, const std::string &path) {
     close_sink(s);
     s.path = path;
     s.fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
+    s.owner = ::getpid();
     struct stat st;
     if (s.fd >= 0 && ::fstat(s.fd, &st) == 0) {
         s.device = st.st_dev;
@@ -80,7 +82,8 @@ bool append(Sink &s, const Target &target, const char *line, size_t length) {
     bool written = false;
     bool failed = false;
     for (int round = 0; round < ROUNDS && !written && !failed; ++round) {
-        if ((s.fd < 0 || s.path != target.path) && !open_sink(s, target.path)) {
+        bool reopen = s.fd < 0 || s.path != target.path || s.owner != ::getpid();
+        if (reopen && !open_sink(s, target.path)) {
             failed = true;
             continue;
         }
