@@ -151,6 +151,12 @@ TEST_F(Validation, AtLeast11Boundaries) {
     }
 }
 
+TEST_F(Validation, EverySettingWithARuleHasItsPlaceInTheSequence) {
+    for (const setting &entry : SETTINGS) {
+        EXPECT_EQ(entry.rule == nullptr, entry.check_order == 0) << entry.keyword;
+    }
+}
+
 TEST_F(Validation, EveryRuleKindIsWhereItBelongs) {
     int at_least_11 = 0;
     for (int32_t *value : CHECKED_IN_ORDER) {

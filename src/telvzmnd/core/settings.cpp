@@ -84,9 +84,6 @@ consteval bool table_is_sound() {
         if ((entry.value == nullptr) != (entry.handling == setting_handling::snapshot_size)) {
             return false;
         }
-        if ((entry.rule == nullptr) != (entry.check_order == 0)) {
-            return false;
-        }
         for (size_t j = i + 1; j < SETTING_COUNT; ++j) {
             if (SETTINGS[j].keyword == entry.keyword) {
                 return false;

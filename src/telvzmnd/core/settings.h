@@ -144,7 +144,7 @@ struct setting {
     const char *trace;        // the settings trace line, with one %d for the value
     std::string_view unit;    // the unit and meaning of the value, for people
     const setting_rule *rule; // null: not validated
-    uint8_t check_order;      // place of the rule in the validation sequence, from 1
+    uint8_t check_order;      // place of the rule in the validation sequence, from 1; 0 = none
 };
 
 // The keywords in the order of the settings table: the first pass compares them in this order and

@@ -7,18 +7,20 @@ namespace {
 inline constexpr size_t RULE_COUNT = [] {
     size_t count = 0;
     for (const setting &entry : SETTINGS) {
-        count += entry.rule != nullptr ? 1 : 0;
+        count += entry.check_order != 0 ? 1 : 0;
     }
     return count;
 }();
 
-// The settings with a rule, in the order of their check_order: that order is the monitor's order
-// of checking, which differs from the order of the keywords.
-consteval std::array<const setting *, RULE_COUNT> checking_sequence() {
-    std::array<const setting *, RULE_COUNT> sequence{};
-    for (const setting &entry : SETTINGS) {
-        if (entry.rule != nullptr) {
-            sequence[entry.check_order - 1] = &entry;
+// The settings with a rule (those with a check_order), as indexes into SETTINGS in the order of
+// their check_order: that order is the monitor's order of checking, which differs from the order
+// of the keywords. Indexes rather than pointers, so that the compiler can check the sequence.
+consteval std::array<size_t, RULE_COUNT> checking_sequence() {
+    std::array<size_t, RULE_COUNT> sequence{};
+    sequence.fill(SETTING_COUNT);
+    for (size_t i = 0; i < SETTING_COUNT; ++i) {
+        if (SETTINGS[i].check_order != 0) {
+            sequence[SETTINGS[i].check_order - 1] = i;
         }
     }
     return sequence;
@@ -27,8 +29,8 @@ consteval std::array<const setting *, RULE_COUNT> checking_sequence() {
 inline constexpr auto CHECKING_SEQUENCE = checking_sequence();
 
 consteval bool sequence_is_complete() {
-    for (const setting *entry : CHECKING_SEQUENCE) {
-        if (entry == nullptr) {
+    for (size_t index : CHECKING_SEQUENCE) {
+        if (index == SETTING_COUNT) {
             return false;
         }
     }
@@ -59,9 +61,9 @@ bool setting_is_valid(const setting &entry) {
 
 TARN_EXPORT const setting *tarn_validate_settings(void) {
     const setting *failed = nullptr;
-    for (const setting *entry : CHECKING_SEQUENCE) {
-        if (!setting_is_valid(*entry)) {
-            failed = entry;
+    for (size_t index : CHECKING_SEQUENCE) {
+        if (!setting_is_valid(SETTINGS[index])) {
+            failed = &SETTINGS[index];
             break;
         }
     }
