@@ -291,33 +291,35 @@ TARN_EXPORT int32_t query_number_of_cpus() {
 
 TARN_EXPORT process_entry *search_pid_in_process_list(int32_t pid, process_list_header *list,
                                                       process_entry *start) {
+    // Walk to the entry of the pid, or to the one it belongs after; a scan in rising pid order
+    // that starts from the previous pid's entry moves one step at most.
     process_entry *e = start != nullptr ? start : &list->head;
     for (;;) {
-        if (pid == e->pid) {
-            return e;
-        }
         if (pid > e->pid && e->next != nullptr && pid >= e->next->pid) {
             e = e->next;
-        } else if (pid >= e->pid || e->previous == nullptr) {
-            break;
-        } else {
+        } else if (pid < e->pid && e->previous != nullptr) {
             e = e->previous;
+        } else {
+            break;
         }
     }
-    auto *made = static_cast<process_entry *>(TARN_CALLOC(1, sizeof(process_entry)));
-    if (made == nullptr) {
-        return nullptr; // the pid goes unsampled this time; the scan goes on
+    process_entry *found = e;
+    if (e->pid != pid) {
+        found = static_cast<process_entry *>(TARN_CALLOC(1, sizeof(process_entry)));
     }
-    std::snprintf(made->file_name, sizeof made->file_name, "/proc/%d/stat", pid);
-    made->pid = pid;
-    made->previous = e;
-    made->next = e->next;
-    if (e->next != nullptr) {
-        e->next->previous = made;
+    // A new entry that cannot be allocated leaves the pid unsampled this time; the scan goes on.
+    if (found != nullptr && found != e) {
+        std::snprintf(found->file_name, sizeof found->file_name, "/proc/%d/stat", pid);
+        found->pid = pid;
+        found->previous = e;
+        found->next = e->next;
+        if (e->next != nullptr) {
+            e->next->previous = found;
+        }
+        e->next = found;
+        list->number_of_entries++;
     }
-    e->next = made;
-    list->number_of_entries++;
-    return made;
+    return found;
 }
 
 TARN_EXPORT void prepare_process_list(process_list_header *list) {
