@@ -1,6 +1,7 @@
 // The snapshot file writer over the default platform's real data files, and tarnmon reading them.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -139,6 +140,23 @@ TEST_F(SnapshotPlatform, WrapKeepsRealFilesWithinTheBound) {
         }
     }
     EXPECT_GT(wraps, 5);
+}
+
+TEST_F(SnapshotPlatform, AFailedOpenOfTheRealServiceReachesTheEventLog) {
+    // The data directory is a plain file, so the open fails with the service's result 8 and
+    // ENOTDIR (0x14), and the report goes out in the system class.
+    std::ofstream(dir_ + "/plain-file") << "x";
+    setenv("TELV_DATA_DIR", (dir_ + "/plain-file").c_str(), 1);
+    setenv("TELV_EVENT_LOG", (dir_ + "/events.log").c_str(), 1);
+    write_snapshot(false, "gathered\n\r");
+    unsetenv("TELV_EVENT_LOG");
+    std::string events = read_file(dir_ + "/events.log");
+    EXPECT_NE(events.find("\"reason\":\"0xE0F1\",\"severity\":\"error\",\"option\":\"0x300\","
+                          "\"compRc\":\"0x14\""),
+              std::string::npos)
+        << events;
+    EXPECT_EQ(std::count(events.begin(), events.end(), '\n'), 1) << events;
+    EXPECT_EQ(file_buffer[0], '\0');
 }
 
 TEST_F(SnapshotPlatform, TarnmonListsWhatTheLibraryWrote) {
