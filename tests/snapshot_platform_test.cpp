@@ -177,25 +177,26 @@ TEST_F(SnapshotPlatform, TarnmonListsWhatTheLibraryWrote) {
     EXPECT_EQ(r.err, "");
 }
 
+// A snapshot as tarnmon shows it on a terminal: every "\n\r" made "\n".
+std::string shown(bool problem, const std::string &body) {
+    return std::string(problem ? PROBLEM_SNAPSHOT_OPENING : PLAIN_SNAPSHOT_OPENING) +
+           "\nLocal date and time = 5 March 2021 at 07:04:09 \nCode Version 61.001\n" + body +
+           "\n\n" + std::string(problem ? PROBLEM_SNAPSHOT_CLOSING : PLAIN_SNAPSHOT_CLOSING) + "\n";
+}
+
 TEST_F(SnapshotPlatform, TarnmonShowsABlockByNumberAndTheLastProblem) {
     write_snapshot(true, "older problem\n\r");
-    std::string plain = write_snapshot(false, "gathered\n\r");
+    write_snapshot(false, "gathered\n\r");
     write_snapshot(true, "newest problem\n\r");
     write_snapshot(false, "after it\n\r");
 
-    run_result shown = tarnmon("2");
-    EXPECT_EQ(shown.status, 0) << shown.err;
-    EXPECT_EQ(shown.out, std::string(PLAIN_SNAPSHOT_OPENING) +
-                             "\nLocal date and time = 5 March 2021 at 07:04:09 \n"
-                             "Code Version 61.001\ngathered\n\n" +
-                             std::string(PLAIN_SNAPSHOT_CLOSING) + "\n");
+    run_result second = tarnmon("2");
+    EXPECT_EQ(second.status, 0) << second.err;
+    EXPECT_EQ(second.out, shown(false, "gathered"));
 
     run_result last = tarnmon("last");
     EXPECT_EQ(last.status, 0) << last.err;
-    EXPECT_EQ(last.out, std::string(PROBLEM_SNAPSHOT_OPENING) +
-                            "\nLocal date and time = 5 March 2021 at 07:04:09 \n"
-                            "Code Version 61.001\nnewest problem\n\n" +
-                            std::string(PROBLEM_SNAPSHOT_CLOSING) + "\n");
+    EXPECT_EQ(last.out, shown(true, "newest problem"));
 }
 
 TEST_F(SnapshotPlatform, TarnmonShowsTheHeadOfAWrappedFileAsPartial) {
