@@ -91,6 +91,21 @@ TEST_F(ControlFile, EmptyLineTakesTheNextLinesWords) {
     EXPECT_STREQ(logtable[1].process_mask, "java");
 }
 
+TEST_F(ControlFile, BlankLinesBeforeALineAllTakeItsWords) {
+    EXPECT_EQ(parse("\n \r\n\t\nMIN_SWAP_SIZE 5 x\n \nLOW_FREE_SIZE 6\n"), 0u);
+    const std::vector<std::string> expected = {
+        first_pass({"MIN_SWAP_SIZE", "5", "x", "LOW_FREE_SIZE", "6"}),
+        first_pass({"MIN_SWAP_SIZE", "5", "x", "LOW_FREE_SIZE", "6"}),
+        first_pass({"MIN_SWAP_SIZE", "5", "x", "LOW_FREE_SIZE", "6"}),
+        first_pass({"MIN_SWAP_SIZE", "5", "x", "LOW_FREE_SIZE", "6"}),
+        first_pass({"LOW_FREE_SIZE", "6"}),
+        first_pass({"LOW_FREE_SIZE", "6"}),
+    };
+    EXPECT_EQ(rec::traces_starting("TARNMNDF:    Input data"), expected);
+    EXPECT_EQ(min_swap_size, 5);
+    EXPECT_EQ(low_free_size, 6);
+}
+
 TEST_F(ControlFile, CheckingIntervalBelowFiveBecomesSixty) {
     parse("CHECKING_INTERVAL 4\n");
     EXPECT_EQ(checking_interval, 60);

@@ -40,8 +40,14 @@ bool is_blank(char c) {
 class word_splitter {
   public:
     void split(const char *text) {
+        const char *at = skip_blanks(text);
+        // Lines whose split begins at the same first word (blank lines before it) get the same
+        // words: they are split once, so that no word is scanned once for every such line.
+        if (at == last_first_word) {
+            return;
+        }
+        last_first_word = at;
         std::memset(words, 0, CONTROL_LINE_WORDS * WORD_SIZE);
-        const char *at = text;
         for (int n = 0; n < CONTROL_LINE_WORDS; ++n) {
             at = skip_blanks(at);
             if (*at == '\0') {
@@ -58,7 +64,7 @@ class word_splitter {
 
   private:
     // Every line of a run of blank lines splits from inside the same run; the run is remembered
-    // so that a file of blank lines is scanned once, not once a line.
+    // so that it is scanned once, not once a line.
     const char *skip_blanks(const char *at) {
         if (at >= blank_from && at < blank_to) {
             return blank_to;
@@ -76,6 +82,7 @@ class word_splitter {
 
     const char *blank_from = nullptr;
     const char *blank_to = nullptr;
+    const char *last_first_word = nullptr;
 };
 
 // Copies at most `limit` characters of `from` into the zeroed field `to`.
