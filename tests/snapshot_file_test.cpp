@@ -256,6 +256,20 @@ TEST_F(SnapshotFile, AnOversizedLineNeverOverrunsASmallBuffer) {
     EXPECT_TRUE(rec::events().empty());
 }
 
+TEST_F(SnapshotFile, AFailedLineEndOfALineTooLongForTheBufferIsE092) {
+    auto small = std::make_unique<char[]>(16);
+    small[0] = '\0';
+    std::vector<char> first = writable("ab");
+    tarn_save_data(first.data(), small.get(), 16, 0);
+    rec::fail(rec::Call::random_write, 8, 0x1C, 2); // the staged text and the line go out
+    std::vector<char> too_long = writable(std::string(14, 'f'));
+    tarn_save_data(too_long.data(), small.get(), 16, 0);
+    EXPECT_EQ(rec::read_data_file(FILE_NAME), "ab\n\r" + std::string(14, 'f'));
+    expect_event(only_event(), 0xE092, 0x1C);
+    EXPECT_EQ(too_long[0], '\0');
+    EXPECT_EQ(small[0], '\0');
+}
+
 TEST_F(SnapshotFile, ABufferSizeOfZeroNeverTouchesTheBuffer) {
     char untouched = 'u';
     std::vector<char> data = writable("zz");
