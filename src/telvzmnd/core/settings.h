@@ -147,8 +147,9 @@ struct setting {
     uint8_t check_order;      // place of the rule in the validation sequence, from 1; 0 = none
 };
 
-// The keywords in the order of the settings table: the first pass compares them in this order and
-// the settings trace follows it, ending with the three row counts.
+// The keywords in the order of the settings trace, which the first pass also compares them in:
+// the order of the keyword list, except that the snapshot file size has always been traced after
+// the general partition threshold; the three row counts end it.
 inline constexpr setting SETTINGS[] = {
     {"ACTUALLY_RUN", &actuallyRun, nullptr, setting_handling::flag, "TARNMNDF: actuallyRun = %d",
      "1 = the monitor runs (the keyword takes no value)", nullptr, 0},
@@ -167,9 +168,6 @@ inline constexpr setting SETTINGS[] = {
     {"TREND_ANALYSIS_NUM_INCREASES", &trend_analysis_num_increases, nullptr,
      setting_handling::plain, "TARNMNDF: trend_analysis_num_increases = %d increases",
      "rises in a row that make a trend", nullptr, 0},
-    {"MAX_SNAPSHOT_FILE_SIZE", nullptr, &max_snapshot_file_size, setting_handling::snapshot_size,
-     "TARNMNDF: max_snapshot_file_size = %d bytes",
-     "bytes (the file gives thousands of bytes; at least 1545056)", nullptr, 0},
     {"LOW_FREE_SIZE", &low_free_size, nullptr, setting_handling::plain,
      "TARNMNDF: low_free_size = %d KB", "KB of LowFree", &AT_LEAST_1, 41},
     {"MIN_SWAP_SIZE", &min_swap_size, nullptr, setting_handling::plain,
@@ -213,6 +211,9 @@ inline constexpr setting SETTINGS[] = {
     {"DASD_PERCENT_THRESHOLD", &dasd_percent_threshold, nullptr, setting_handling::plain,
      "TARNMNDF: dasd_percent_threshold = %d percent",
      "percent (x10) of space or inodes of a partition not listed", &AT_LEAST_11, 10},
+    {"MAX_SNAPSHOT_FILE_SIZE", nullptr, &max_snapshot_file_size, setting_handling::snapshot_size,
+     "TARNMNDF: max_snapshot_file_size = %d bytes",
+     "bytes (the file gives thousands of bytes; at least 1545056)", nullptr, 0},
     {"DASD_PERCENT_SLASH_THRESHOLD", &dasd_percent_slash_threshold, nullptr,
      setting_handling::plain, "TARNMNDF: dasd_percent_slash_threshold = %d percent",
      "percent (x10) of space of /", &AT_LEAST_11, 11},
