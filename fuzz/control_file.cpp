@@ -13,16 +13,7 @@
 namespace {
 
 void release_everything() {
-    for (int32_t i = 0; logtable != nullptr && i < num_log_thresholds; ++i) {
-        if (logtable[i].compiled == 1) {
-            regfree(&logtable[i].expression);
-        }
-    }
-    for (int32_t i = 0; aborttable != nullptr && i < num_abort_thresholds; ++i) {
-        if (aborttable[i].compiled == 1) {
-            regfree(&aborttable[i].expression);
-        }
-    }
+    free_compiled_expressions();
     uint32_t crc = 0;
     release_control_file_tables(&crc);
 }

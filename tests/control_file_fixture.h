@@ -15,16 +15,7 @@ namespace control_file_test {
 // Frees what a parse took: the compiled expressions (which the monitor itself never frees), then
 // the tables through the monitor's own release.
 inline void release_everything() {
-    for (int32_t i = 0; logtable != nullptr && i < num_log_thresholds; ++i) {
-        if (logtable[i].compiled == 1) {
-            regfree(&logtable[i].expression);
-        }
-    }
-    for (int32_t i = 0; aborttable != nullptr && i < num_abort_thresholds; ++i) {
-        if (aborttable[i].compiled == 1) {
-            regfree(&aborttable[i].expression);
-        }
-    }
+    free_compiled_expressions();
     uint32_t crc = 0;
     release_control_file_tables(&crc);
 }

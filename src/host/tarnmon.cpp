@@ -20,7 +20,8 @@ constexpr command COMMANDS[] = {
     {"check-config", command_check_config,
      "check-config [FILE]    check a control file as the monitor would read it"},
     {"snapshots", command_snapshots,
-     "snapshots [N|last]     list the snapshot file, or show snapshot N or the last problem one"},
+     "snapshots [--file PATH] [N|last]\n"
+     "                         list the snapshot file, or show snapshot N or the last problem one"},
 };
 
 void usage(FILE *out) {

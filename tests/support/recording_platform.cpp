@@ -86,8 +86,6 @@ void make_directory() {
 }
 
 struct Cleanup {
-    // The state is made first, so that it is destroyed after this cleanup has used it.
-    Cleanup() { state(); }
     ~Cleanup() {
         State &s = state();
         if (!s.directory.empty()) {

@@ -206,27 +206,21 @@ TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock) {
     do {
         tracesvc_trace("TARNTLCF: before TARN_CB_PTR->uBufferLock = %x (hex)",
                        TARN_CB_PTR->uBufferLock);
-        if (lock == 1) {
-            tracesvc_trace("TARNTLCF: try to lock");
-            rc = sysv_ipc.semop(TARN_CB_PTR->uBufferLock, lockSem, 2);
-            error_number = rc == -1 ? errno : 0;
-            tracesvc_trace("TARNTLCF: after TARN_CB_PTR->uBufferLock (lock case) = %x (hex)",
-                           TARN_CB_PTR->uBufferLock);
-            tracesvc_trace("TARNTLCF: osl_rc = %x (hex)", rc);
-            tracesvc_trace("TARNTLCF: error_number = %x (hex)", error_number);
-        } else {
-            tracesvc_trace("TARNTLCF: try to unlock");
-            rc = sysv_ipc.semop(TARN_CB_PTR->uBufferLock, unlockSem, 1);
-            error_number = rc == -1 ? errno : 0;
-            tracesvc_trace("TARNTLCF: after TARN_CB_PTR->uBufferLock (unlock case) = %x (hex)",
-                           TARN_CB_PTR->uBufferLock);
-            tracesvc_trace("TARNTLCF: osl_rc = %x (hex)", rc);
-            tracesvc_trace("TARNTLCF: error_number = %x (hex)", error_number);
-            // Unlocking a table that nobody holds counts as success.
-            if (error_number == EAGAIN) {
-                rc = 0;
-                error_number = 0;
-            }
+        bool locking = lock == 1;
+        tracesvc_trace(locking ? "TARNTLCF: try to lock" : "TARNTLCF: try to unlock");
+        rc = sysv_ipc.semop(TARN_CB_PTR->uBufferLock, locking ? lockSem : unlockSem,
+                            locking ? 2 : 1);
+        error_number = rc == -1 ? errno : 0;
+        tracesvc_trace(locking
+                           ? "TARNTLCF: after TARN_CB_PTR->uBufferLock (lock case) = %x (hex)"
+                           : "TARNTLCF: after TARN_CB_PTR->uBufferLock (unlock case) = %x (hex)",
+                       TARN_CB_PTR->uBufferLock);
+        tracesvc_trace("TARNTLCF: osl_rc = %x (hex)", rc);
+        tracesvc_trace("TARNTLCF: error_number = %x (hex)", error_number);
+        // Unlocking a table that nobody holds counts as success.
+        if (!locking && error_number == EAGAIN) {
+            rc = 0;
+            error_number = 0;
         }
         tracesvc_trace("TARNTLCF: after TARN_CB_PTR->uBufferLock = %x (hex)",
                        TARN_CB_PTR->uBufferLock);

@@ -360,9 +360,21 @@ TARN_EXPORT uint32_t tarn_parse_control_file(const char *fileData, uint32_t *crc
     return src;
 }
 
+void free_compiled_expressions() {
+    for (int32_t i = 0; logtable != nullptr && i < num_log_thresholds; ++i) {
+        if (logtable[i].compiled == 1) {
+            regfree(&logtable[i].expression);
+        }
+    }
+    for (int32_t i = 0; aborttable != nullptr && i < num_abort_thresholds; ++i) {
+        if (aborttable[i].compiled == 1) {
+            regfree(&aborttable[i].expression);
+        }
+    }
+}
+
 // The compiled expressions inside the rows are not given back with regfree: the monitor has never
-// released them, and a table is freed only when monitoring ends. Whoever parses many times in one
-// process (tests, the fuzz target) frees them before calling this.
+// released them, and a table is freed only when monitoring ends.
 void release_control_file_tables(uint32_t *crc) {
     if (calllist1 != nullptr) {
         for (int32_t i = 0; i < num_external_calls; ++i) {

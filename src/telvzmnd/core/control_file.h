@@ -63,6 +63,10 @@ TARN_EXPORT uint32_t tarn_parse_control_file(const char *fileData, uint32_t *crc
 // Gives back every resolved routine to the module service and frees the three tables, setting
 // their pointers to null; the counts stay. Out: *crc, as left by the module service.
 void release_control_file_tables(uint32_t *crc);
+// Gives back the compiled expressions of the rows, which the monitor keeps to the end of the
+// process; for whoever parses many times in one process (tests, the fuzz target), before the
+// release of the tables.
+void free_compiled_expressions();
 
 // What the monitor passes over without a word, kept so that a checker can name it: a row whose
 // expression did not compile (the monitor drops it) and a routine that did not resolve.
