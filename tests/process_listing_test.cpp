@@ -31,6 +31,10 @@ const std::string two_cpus_found[] = {
     "TARNCPUF: query_number_of_cpus: found number 0, new total: 1",
     "TARNCPUF: query_number_of_cpus: found number 1, new total: 2"};
 
+// Seven percentage cells of 0.00: the older end of a row with three samples.
+const std::string zeros = "|     +0.00| |     +0.00| |     +0.00| |     +0.00| |     +0.00| "
+                          "|     +0.00| |     +0.00| ";
+
 class ProcessListing : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -133,6 +137,58 @@ TEST_F(ProcessListing, BackDatedFirstTickIsTruncated) {
     update_process_list(&process_list);
     EXPECT_EQ(process_list.sample_ticks[9], 980); // 1000 - 19.8, truncated
     EXPECT_EQ(process_list.current_sample, 1);
+}
+
+TEST_F(ProcessListing, BackDatingTruncatesTowardsZero) {
+    reset_process_listing_state();
+    fake::fake_proc odd_rate(10, 33);
+    odd_rate.set_cpus(1);
+    update_process_list(&process_list);
+    EXPECT_EQ(process_list.sample_ticks[9], -9); // 10 - 19.8 = -9.8, not -10
+    EXPECT_EQ(process_list.current_sample, 1);
+}
+
+TEST_F(ProcessListing, FirstUpdateZeroesTheHeadAndLeavesTheOtherSamples) {
+    process_list.head.pid = 77;
+    process_list.head.seen = 1;
+    process_list.head.user_percent[3] = 5.0f;
+    std::strcpy(process_list.head.process_name, "(stale)");
+    process_list.current_sample = 6;
+    process_list.number_of_entries = 40;
+    for (int i = 0; i < 10; ++i) {
+        process_list.sample_ticks[i] = 100 + i;
+    }
+    update_process_list(&process_list);
+
+    process_entry zeroed_head{};
+    std::strcpy(zeroed_head.file_name, "/proc/1/stat");
+    EXPECT_EQ(std::memcmp(&process_list.head, &zeroed_head, sizeof zeroed_head), 0);
+    EXPECT_EQ(process_list.number_of_entries, 1);
+    EXPECT_EQ(process_list.current_sample, 1);
+    EXPECT_EQ(process_list.sample_ticks[0], 1000);
+    EXPECT_EQ(process_list.sample_ticks[9], 940);
+    for (int i = 1; i < 9; ++i) {
+        EXPECT_EQ(process_list.sample_ticks[i], 100 + i) << i;
+    }
+}
+
+TEST_F(ProcessListing, HalfASecondIsMeasuredInFractionsOfATick) {
+    reset_process_listing_state();
+    fake::fake_proc odd_rate(1000, 33); // half a second is 16.5 ticks
+    odd_rate.set_cpus(1);
+    update_process_list(&process_list);
+    rec::clear_traces();
+
+    odd_rate.advance(16);
+    update_process_list(&process_list);
+    EXPECT_EQ(rec::traces(), (Traces{enter, skip}));
+    EXPECT_EQ(process_list.current_sample, 1);
+
+    odd_rate.advance(1);
+    update_process_list(&process_list);
+    EXPECT_EQ(rec::traces().back(), leave);
+    EXPECT_EQ(process_list.current_sample, 2);
+    EXPECT_EQ(process_list.sample_ticks[1], 1017);
 }
 
 TEST_F(ProcessListing, UpdateWithinHalfASecondIsSkippedAndChangesNothing) {
@@ -333,11 +389,30 @@ TEST_F(ProcessListing, PidThatDisappearsIsPrintedOnceMoreThenGone) {
     ASSERT_NE(leaving, nullptr);
     EXPECT_EQ(leaving->seen, 0);
     EXPECT_EQ(process_list.number_of_entries, 3);
-    std::string table = print_to_text();
-    EXPECT_NE(table.find("pid: 200, name: (leaving), priority: 20, nice: 0\n"
-                         "user:   |     +0.00| |    +10.00| |     +0.00| "),
-              std::string::npos)
-        << table;
+    // The newest column is the slot this update did not write for the vanished pid.
+    EXPECT_EQ(print_to_text(),
+              "checks: |      +1200||      +1100||      +1000||       +940||         +0|"
+              "|         +0||         +0||         +0||         +0||         +0|\n"
+              "pid: 7, name: (init), priority: 20, nice: 0\n"
+              "user:   |     +0.00| |     +0.00| |     +0.00| " +
+                  zeros +
+                  "\n"
+                  "kernel: |     +0.00| |     +0.00| |     +0.00| " +
+                  zeros +
+                  "\n"
+                  "pid: 200, name: (leaving), priority: 20, nice: 0\n"
+                  "user:   |     +0.00| |    +10.00| |     +0.00| " +
+                  zeros +
+                  "\n"
+                  "kernel: |     +0.00| |     +5.00| |     +0.00| " +
+                  zeros +
+                  "\n"
+                  "Overall system\n"
+                  "user: |     +0.00| |    +10.00| |     +0.00| " +
+                  zeros +
+                  "\n"
+                  "kernel:|     +0.00| |     +5.00| |     +0.00| " +
+                  zeros + "\n");
 
     update_after(100);
     EXPECT_EQ(entry_of(200), nullptr);
@@ -604,9 +679,6 @@ class PrintedHistory : public ProcessListing {
     }
 };
 
-const std::string zeros = "|     +0.00| |     +0.00| |     +0.00| |     +0.00| |     +0.00| "
-                          "|     +0.00| |     +0.00| ";
-
 TEST_F(PrintedHistory, TableTextIsExact) {
     char *text = nullptr;
     int result = print_process_list(&process_list, &text);
@@ -676,6 +748,83 @@ TEST_F(PrintedHistory, TextAreaThatCannotBeAllocatedLeavesTheRowsInTheTrace) {
     EXPECT_EQ(rec::traces()[8], "TARNCPUF: Overall system:");
 }
 
+// Twelve samples on three processors, so that the ring has wrapped and the newest sample sits in
+// slot 1: the columns run from slot 1 down through slot 0 to slot 2.
+class WrappedHistory : public ProcessListing {
+  protected:
+    void SetUp() override {
+        ProcessListing::SetUp();
+        tree->set_ticks(5000);
+        tree->set_cpus(3);
+        for (uint32_t k = 0; k < 12; ++k) {
+            // user share k %, kernel share one third %
+            tree->set_process(5, "ring", 10 + 3 * k * (k + 1) / 2, 5 + k, 20, 0);
+            // user share 95 %, no kernel time
+            tree->set_process(9, "hog", 1000 + 285 * k, 50, 0, -20);
+            update_after(k == 0 ? 0 : 100);
+        }
+        rec::clear_traces();
+    }
+};
+
+TEST_F(WrappedHistory, TableTextIsExact) {
+    ASSERT_EQ(process_list.current_sample, 2);
+    char *text = nullptr;
+    print_process_list(&process_list, &text);
+    ASSERT_NE(text, nullptr);
+    EXPECT_EQ(std::string(text),
+              "checks: |      +6100||      +6000||      +5900||      +5800||      +5700|"
+              "|      +5600||      +5500||      +5400||      +5300||      +5200|\n"
+              "pid: 5, name: (ring), priority: 20, nice: 0\n"
+              "user:   |    +11.00| |    +10.00| |     +9.00| |     +8.00| |     +7.00| "
+              "|     +6.00| |     +5.00| |     +4.00| |     +3.00| |     +2.00| \n"
+              "kernel: |     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+              "|     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| \n"
+              "pid: 9, name: (hog), priority: 0, nice: -20\n"
+              "user:   |    +95.00| |    +95.00| |    +95.00| |    +95.00| |    +95.00| "
+              "|    +95.00| |    +95.00| |    +95.00| |    +95.00| |    +95.00| \n"
+              "kernel: |     +0.00| |     +0.00| |     +0.00| |     +0.00| |     +0.00| "
+              "|     +0.00| |     +0.00| |     +0.00| |     +0.00| |     +0.00| \n"
+              "Overall system\n"
+              "user: |   +100.00| |   +100.00| |   +100.00| |   +100.00| |   +100.00| "
+              "|   +100.00| |   +100.00| |    +99.00| |    +98.00| |    +97.00| \n"
+              "kernel:|     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+              "|     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| \n");
+    telvmemdebug_free(text, "test", 0);
+}
+
+TEST_F(WrappedHistory, TracedRowsAreExact) {
+    print_process_list(&process_list, nullptr);
+    EXPECT_EQ(rec::traces(),
+              (Traces{"TARNCPUF: ->print_process_list",
+                      "TARNCPUF: checks: |      +6100||      +6000||      +5900||      +5800|"
+                      "|      +5700||      +5600||      +5500||      +5400||      +5300|"
+                      "|      +5200| ",
+                      "TARNCPUF: pid: 5, name: (ring), priority: 20, nice: 0",
+                      "TARNCPUF: user:   |    +11.00| |    +10.00| |     +9.00| |     +8.00| "
+                      "|     +7.00| |     +6.00| |     +5.00| |     +4.00| |     +3.00| "
+                      "|     +2.00| ",
+                      "TARNCPUF: kernel: |     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+                      "|     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+                      "|     +0.33| ",
+                      "TARNCPUF: pid: 9, name: (hog), priority: 0, nice: -20",
+                      "TARNCPUF: user:   |    +95.00| |    +95.00| |    +95.00| |    +95.00| "
+                      "|    +95.00| |    +95.00| |    +95.00| |    +95.00| |    +95.00| "
+                      "|    +95.00| ",
+                      "TARNCPUF: kernel: |     +0.00| |     +0.00| |     +0.00| |     +0.00| "
+                      "|     +0.00| |     +0.00| |     +0.00| |     +0.00| |     +0.00| "
+                      "|     +0.00| ",
+                      "TARNCPUF: Overall system:",
+                      "TARNCPUF: user: |   +100.00| |   +100.00| |   +100.00| |   +100.00| "
+                      "|   +100.00| |   +100.00| |   +100.00| |    +99.00| |    +98.00| "
+                      "|    +97.00| ",
+                      "TARNCPUF: kernel:|     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+                      "|     +0.33| |     +0.33| |     +0.33| |     +0.33| |     +0.33| "
+                      "|     +0.33| ",
+                      "TARNCPUF: <-print_process_list"}));
+    EXPECT_EQ(rec::live_allocations().size(), 2u);
+}
+
 TEST_F(ProcessListing, OverallSumsAreCappedAtAHundred) {
     tree->set_process(7, "sixty", 100, 100);
     tree->set_process(8, "fifty-five", 100, 100);
@@ -687,9 +836,9 @@ TEST_F(ProcessListing, OverallSumsAreCappedAtAHundred) {
     EXPECT_EQ(entry_of(8)->user_percent[1], 55.0f);
 
     std::string table = print_to_text();
-    EXPECT_NE(table.find("Overall system\nuser: |   +100.00| |     +0.00| |     +0.00| " + zeros +
-                         "\nkernel:|     +0.00| |     +0.00| |     +0.00| " + zeros + "\n"),
-              std::string::npos)
+    EXPECT_TRUE(table.ends_with("Overall system\nuser: |   +100.00| |     +0.00| |     +0.00| " +
+                                zeros + "\nkernel:|     +0.00| |     +0.00| |     +0.00| " + zeros +
+                                "\n"))
         << table;
 }
 
