@@ -3,6 +3,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <filesystem>
+#include <fstream>
 #include <limits>
 #include <memory>
 #include <random>
@@ -424,18 +426,45 @@ TEST_F(SnapshotFile, ANulInTheOldFileEndsItsText) {
     EXPECT_EQ(rec::read_data_file(FILE_NAME), old.substr(100, 400) + NEW_TEXT);
 }
 
-TEST_F(SnapshotFile, ADeltaBeyondTheTextKeepsNothing) {
+TEST_F(SnapshotFile, ADeltaBeyondTheTextKeepsNothingAndItsEmptyWriteIsE096) {
     // The old file's text ends at once (a NUL at its head), so with a bound of 0 the cut lies past
-    // the 602 bytes of text: the file is made again, empty.
+    // the 602 bytes of text: the file is made again, and writing its empty text writes 0 bytes.
     rec::write_data_file(FILE_NAME, std::string(1, '\0') + filler(999));
     max_snapshot_file_size = 0;
-    stage_600_and_flush();
+    expect_emptied(stage_600_and_flush());
     EXPECT_TRUE(rec::data_file_exists(FILE_NAME));
     EXPECT_EQ(rec::read_data_file(FILE_NAME), "");
     EXPECT_TRUE(rec::has_trace("TARNSDAD: delta = 640 (hex)"));
-    EXPECT_EQ(rec::calls(rec::Call::random_write), 0);
-    EXPECT_TRUE(rec::events().empty());
+    EXPECT_EQ(rec::calls(rec::Call::random_write), 1);
+    EXPECT_TRUE(rec::has_trace("TARNSDAD: byte_count = 0"));
+    expect_event(only_event(), 0xE096, 0);
+    EXPECT_TRUE(rec::has_trace("TARNMNDF:     sysRc = 2   compRc = 0   uiErrorId = e096"));
     EXPECT_EQ(rec::open_data_files(), open_before_);
+}
+
+TEST_F(SnapshotFile, AFileAndTextPastFourGigabytesRollOverAndAreAppended) {
+    // A sparse file 256 bytes short of 4 GB: with 602 bytes of text the 32-bit sum rolls over to
+    // 344, below the largest bound, so the text is appended and no wrap (which would need a work
+    // area, refused here) is tried.
+    constexpr uint32_t OLD_SIZE = 0xFFFFFF00;
+    std::string path = rec::data_dir() + "/" + FILE_NAME;
+    rec::write_data_file(FILE_NAME, "");
+    std::filesystem::resize_file(path, OLD_SIZE);
+    max_snapshot_file_size = 0xFFFFFFFF;
+    rec::fail(rec::Call::malloc, 0);
+    expect_emptied(stage_600_and_flush());
+    EXPECT_EQ(std::filesystem::file_size(path), uint64_t{OLD_SIZE} + NEW_TEXT.size());
+    std::ifstream file(path, std::ios::binary);
+    file.seekg(OLD_SIZE);
+    std::string tail(NEW_TEXT.size() + 1, '\0');
+    file.read(tail.data(), static_cast<std::streamsize>(tail.size()));
+    tail.resize(static_cast<size_t>(file.gcount()));
+    EXPECT_TRUE(tail == NEW_TEXT);
+    EXPECT_EQ(rec::traces(), (std::vector<std::string>{"TARNSDAD: buflen = 602 (dec)",
+                                                       "TARNSDAD: byte_count = 602"}));
+    EXPECT_EQ(rec::calls(rec::Call::random_read), 0);
+    EXPECT_EQ(rec::calls(rec::Call::delete_file), 0);
+    EXPECT_TRUE(rec::events().empty());
 }
 
 TEST_F(SnapshotFile, TheOversizedLineJoinsTheWrappedText) {
@@ -508,7 +537,15 @@ TEST_F(SnapshotFile, AFailedReopenLosesTheFileWithoutAReport) {
     expect_emptied(stage_600_and_flush());
     EXPECT_FALSE(rec::data_file_exists(FILE_NAME));
     EXPECT_TRUE(rec::events().empty());
-    EXPECT_TRUE(rec::has_trace("TARNSDAF: filesvc_search_file_open failed"));
+    // Neither reported nor traced: only the opens that begin a flush say that they failed.
+    const auto &t = rec::traces();
+    ASSERT_EQ(t.size(), 4u);
+    EXPECT_EQ(t[0], "TARNSDAD: buflen = 602 (dec)");
+    EXPECT_EQ(t[1], "TARNSDAD: byte_count = 1000");
+    EXPECT_EQ(t[2], "TARNSDAD: delta = 64 (hex)");
+    EXPECT_TRUE(t[3].starts_with("TARNSDAD: start_ptr = 0x")) << t[3];
+    EXPECT_EQ(rec::calls(rec::Call::search_file_open), 2);
+    EXPECT_EQ(rec::calls(rec::Call::random_write), 0);
     EXPECT_EQ(rec::open_data_files(), open_before_);
 }
 
@@ -647,6 +684,24 @@ TEST_F(SnapshotFile, TimeStampWithTwoDigitFieldsAndMidnight) {
                                         "Code Version 61.001\n\r");
 }
 
+// Two digits built without printf, to check the time stamp's own padding against.
+std::string two_digits(int value) {
+    return {static_cast<char>('0' + value / 10), static_cast<char>('0' + value % 10)};
+}
+
+TEST_F(SnapshotFile, TimeStampPadsEveryHourMinuteAndSecondToTwoDigits) {
+    for (int value = 0; value < 60; ++value) {
+        SCOPED_TRACE(value);
+        file_buffer[0] = '\0';
+        fixed_now = utc(2021, 3, 5, value % 24, value, 59 - value);
+        tarn_add_timestamp();
+        EXPECT_EQ(std::string(file_buffer), "Local date and time = 5 March 2021 at " +
+                                                two_digits(value % 24) + ":" + two_digits(value) +
+                                                ":" + two_digits(59 - value) +
+                                                " \n\rCode Version 61.001\n\r");
+    }
+}
+
 TEST_F(SnapshotFile, TimeStampNamesEveryMonth) {
     const char *names[] = {"January", "February", "March",     "April",   "May",      "June",
                            "July",    "August",   "September", "October", "November", "December"};
@@ -747,7 +802,8 @@ TEST_F(SnapshotFile, ManySnapshotsKeepTheFileWithinItsBoundAndTheNewestBlockWhol
             static_cast<uint32_t>(40 * (longest + 2) + 400 + writer.random() % (60 * longest));
         for (int block = 0; block < 60; ++block) {
             int deletes_before = rec::calls(rec::Call::delete_file);
-            size_t size_before = rec::read_data_file(FILE_NAME).size();
+            std::string before = rec::read_data_file(FILE_NAME);
+            size_t size_before = before.size();
             bool problem = writer.random() % 3 == 0;
             std::string expected = writer.write(problem, writer.random() % 40, longest);
             std::string file = rec::read_data_file(FILE_NAME);
@@ -756,9 +812,14 @@ TEST_F(SnapshotFile, ManySnapshotsKeepTheFileWithinItsBoundAndTheNewestBlockWhol
             ASSERT_TRUE(file.ends_with(expected)) << "block " << block;
             bool wrapped = rec::calls(rec::Call::delete_file) > deletes_before;
             ASSERT_EQ(wrapped, size_before + expected.size() - 2 >= max_snapshot_file_size);
-            if (wrapped && file.find(WRAP_MARKER) != std::string::npos) {
-                ASSERT_TRUE(file.starts_with(WRAP_MARKER)) << "block " << block;
+            // The old file and the block, from the first marker at or after the cut on.
+            std::string kept = before + expected;
+            if (wrapped) {
+                size_t delta = size_before + expected.size() - 2 - max_snapshot_file_size;
+                size_t marker = kept.find(WRAP_MARKER, delta);
+                kept.erase(0, marker == std::string::npos ? delta : marker);
             }
+            ASSERT_TRUE(file == kept) << "block " << block;
             ASSERT_TRUE(rec::events().empty());
             ASSERT_EQ(file_buffer[0], '\0');
         }

@@ -52,10 +52,16 @@ void report(uint32_t open_rc, uint32_t crc, reason_code code) {
 
 uint32_t open_snapshot_file(filesvc_handle_t *handle, uint32_t *crc) {
     uint32_t info = 0;
-    uint32_t rc = filesvc_search_file_open(SNAPSHOT_FILE_NAME, FILESVC_OPEN_OR_CREATE,
-                                           FILESVC_ACCESS_READ_WRITE, 0, 0, handle, &info, crc);
+    return filesvc_search_file_open(SNAPSHOT_FILE_NAME, FILESVC_OPEN_OR_CREATE,
+                                    FILESVC_ACCESS_READ_WRITE, 0, 0, handle, &info, crc);
+}
+
+// The open that begins a flush: a failure is traced and reported with `reason`.
+uint32_t open_or_report(filesvc_handle_t *handle, uint32_t *crc, reason_code reason) {
+    uint32_t rc = open_snapshot_file(handle, crc);
     if (rc != 0) {
         tracesvc_trace("TARNSDAF: filesvc_search_file_open failed");
+        report(rc, *crc, reason);
     }
     return rc;
 }
@@ -88,9 +94,8 @@ bool append_oversized_line(filesvc_handle_t handle, const flush_request &request
 void append_to_file(const flush_request &request) {
     filesvc_handle_t handle = 0;
     uint32_t crc = 0;
-    uint32_t open_rc = open_snapshot_file(&handle, &crc);
+    uint32_t open_rc = open_or_report(&handle, &crc, RC_SNAPSHOT_OPEN_APPEND);
     if (open_rc != 0) {
-        report(open_rc, crc, RC_SNAPSHOT_OPEN_APPEND);
         return;
     }
     std::string_view staged = staged_text(request);
@@ -110,9 +115,8 @@ int64_t read_old_and_add_new(const flush_request &request, uint32_t file_size, c
                              size_t work_size) {
     filesvc_handle_t handle = 0;
     uint32_t crc = 0;
-    uint32_t open_rc = open_snapshot_file(&handle, &crc);
+    uint32_t open_rc = open_or_report(&handle, &crc, RC_SNAPSHOT_OPEN_WRAP);
     if (open_rc != 0) {
-        report(open_rc, crc, RC_SNAPSHOT_OPEN_WRAP);
         return -1;
     }
     std::memset(work, 0, work_size);
@@ -149,8 +153,8 @@ int64_t read_old_and_add_new(const flush_request &request, uint32_t file_size, c
 
 // Where the kept text starts: the first wrap marker at or after `delta`, else `delta` itself
 // (mid-line). A `delta` beyond the text (an old file that held a NUL or shrank after its size was
-// taken) keeps nothing.
-size_t kept_start(const char *work, size_t length, uint64_t delta) {
+// taken) keeps nothing, and the write of that nothing fails as a write of 0 bytes does.
+size_t kept_start(const char *work, size_t length, uint32_t delta) {
     size_t cut = delta < length ? static_cast<size_t>(delta) : length;
     size_t marker = std::string_view(work + cut, length - cut).find(WRAP_MARKER);
     return marker == std::string_view::npos ? cut : cut + marker;
@@ -168,7 +172,7 @@ void rewrite_file(const char *text, size_t length) {
     if (open_rc != 0) {
         return; // the old file is gone and the text with it; there is nothing left to report on
     }
-    if (length != 0 && !write_text(handle, text, length, FILESVC_AT_OFFSET, &crc)) {
+    if (!write_text(handle, text, length, FILESVC_AT_OFFSET, &crc)) {
         report(open_rc, crc, RC_SNAPSHOT_WRITE_TRIMMED);
     }
     if (filesvc_close_file(handle, &crc) != 0) {
@@ -178,7 +182,8 @@ void rewrite_file(const char *text, size_t length) {
 
 // Drops the oldest text so that the file keeps at most `max_snapshot_file_size` + 2 bytes,
 // preferring to restart at a plain snapshot.
-void wrap_file(const flush_request &request, uint32_t file_size) {
+void wrap_file(const flush_request &request, uint32_t file_size, uint32_t delta) {
+    // Sized in 64 bits whatever the sum in 32 came to, so that the whole old file always fits.
     size_t work_size = request.combined + file_size + WRAP_SLACK;
     char *work = static_cast<char *>(TARN_MALLOC(work_size));
     if (work == nullptr) {
@@ -186,8 +191,7 @@ void wrap_file(const flush_request &request, uint32_t file_size) {
     }
     int64_t length = read_old_and_add_new(request, file_size, work, work_size);
     if (length >= 0) {
-        uint64_t delta = request.combined + file_size - max_snapshot_file_size;
-        tracesvc_trace("TARNSDAD: delta = %x (hex)", static_cast<uint32_t>(delta));
+        tracesvc_trace("TARNSDAD: delta = %x (hex)", delta);
         size_t start = kept_start(work, static_cast<size_t>(length), delta);
         tracesvc_trace("TARNSDAD: start_ptr = %p", static_cast<void *>(work + start));
         rewrite_file(work + start, static_cast<size_t>(length) - start);
@@ -202,9 +206,11 @@ void flush(const flush_request &request) {
         file_size = 0; // not there yet: the append creates it
     }
     tracesvc_trace("TARNSDAD: buflen = %d (dec)", static_cast<int>(staged_text(request).size()));
-    // Summed in 64 bits: a file that would pass 4 GB wraps rather than grows.
-    if (file_size + request.combined >= max_snapshot_file_size) {
-        wrap_file(request, file_size);
+    // An unsigned 32-bit sum, like the file sizes of the service: a file and a text that pass
+    // 4 GB together roll over to a small sum and are appended.
+    uint32_t total = file_size + static_cast<uint32_t>(request.combined);
+    if (total >= max_snapshot_file_size) {
+        wrap_file(request, file_size, total - max_snapshot_file_size);
     } else {
         append_to_file(request);
     }
