@@ -122,6 +122,21 @@ TEST(SnapshotReader, SeparatorsMustBeWholeLines) {
     EXPECT_EQ(blocks[1].offset, file.size() - plain("").size());
 }
 
+TEST(SnapshotReader, AFileCutInsideALineEndStartsAtTheNextLine) {
+    // The cut fell between "\n" and "\r" just before a problem opening, which holds no marker.
+    std::string block = problem("body\n\r");
+    std::string file = "\r" + block + plain("");
+    auto blocks = read_snapshots(file);
+    ASSERT_EQ(blocks.size(), 2u);
+    EXPECT_EQ(blocks[0].kind, snapshot_kind::problem);
+    EXPECT_EQ(blocks[0].state, snapshot_state::complete);
+    EXPECT_EQ(blocks[0].offset, 1u);
+    EXPECT_EQ(blocks[0].text, block);
+    EXPECT_EQ(blocks[0].timestamp, "5 March 2021 at 07:04:09");
+    EXPECT_EQ(blocks[1].kind, snapshot_kind::plain);
+    EXPECT_EQ(blocks[1].state, snapshot_state::complete);
+}
+
 TEST(SnapshotReader, CarriageReturnLineFeedEndsAreReadToo) {
     std::string file = std::string(PLAIN_SNAPSHOT_OPENING) + "\r\n" +
                        "Local date and time = 1 May 2020 at 01:02:03 \r\n" +

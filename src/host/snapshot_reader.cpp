@@ -89,7 +89,9 @@ std::vector<snapshot_block> read_snapshots(std::string_view file) {
     bool open = false;
     snapshot_kind open_kind = snapshot_kind::unknown;
     size_t pending = 0; // first byte not yet given to a block
-    size_t at = 0;
+    // A wrap that cut between the two bytes of a line end leaves the "\r" at the head of the file,
+    // in front of the next line.
+    size_t at = file.starts_with('\r') ? 1 : 0;
     while (at < file.size()) {
         size_t newline = file.find('\n', at);
         size_t content_end = newline == std::string_view::npos ? file.size() : newline;
