@@ -2,6 +2,7 @@
 
 #include <cstdio>
 #include <cstring>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -104,6 +105,106 @@ TEST_F(ControlFile, BlankLinesBeforeALineAllTakeItsWords) {
     EXPECT_EQ(rec::traces_starting("TARNMNDF:    Input data"), expected);
     EXPECT_EQ(min_swap_size, 5);
     EXPECT_EQ(low_free_size, 6);
+}
+
+// What sscanf with twelve "%s" gives from `from`, each word then cut at 249 characters as the
+// monitor cuts it; buffers as long as the whole text, so that no word can overrun them.
+std::vector<std::string> words_as_sscanf_splits(const char *from) {
+    const size_t room = std::strlen(from) + 1;
+    std::vector<std::vector<char>> slot(12, std::vector<char>(room, '\0'));
+    std::sscanf(from, "%s %s %s %s %s %s %s %s %s %s %s %s", slot[0].data(), slot[1].data(),
+                slot[2].data(), slot[3].data(), slot[4].data(), slot[5].data(), slot[6].data(),
+                slot[7].data(), slot[8].data(), slot[9].data(), slot[10].data(), slot[11].data());
+    std::vector<std::string> split;
+    for (const auto &word : slot) {
+        split.emplace_back(word.data(), strnlen(word.data(), 249));
+    }
+    return split;
+}
+
+// The first-pass trace lines of `text`, one for each line ending in a line feed, each split from
+// the line's first byte by sscanf itself.
+std::vector<std::string> traces_by_sscanf(const std::string &text) {
+    std::vector<std::string> lines;
+    const char *all = text.c_str();
+    for (const char *start = all; const char *end = std::strchr(start, '\n'); start = end + 1) {
+        std::string line = "TARNMNDF:    Input data = ";
+        const auto split = words_as_sscanf_splits(start);
+        for (size_t n = 0; n < split.size(); ++n) {
+            line += (n == 0 ? "[" : " [") + split[n] + "]";
+        }
+        lines.push_back(line);
+    }
+    return lines;
+}
+
+// A text of words, blank runs, blank lines, comments, bytes above 127, words around the 249-byte
+// cut and an occasional last line without its line feed.
+std::string random_control_text(std::mt19937 &random) {
+    static const char blanks[] = {' ', '\t', '\r', '\v', '\f', '\n'};
+    static const char letters[] = {'A', 'b', '1', '-', '*', '\xa0', '\x85', '\xff', '_'};
+    auto below = [&random](size_t limit) {
+        return std::uniform_int_distribution<size_t>(0, limit - 1)(random);
+    };
+    std::string text;
+    const size_t pieces = below(60);
+    for (size_t i = 0; i < pieces; ++i) {
+        switch (below(6)) {
+        case 0: // a run of blank lines
+            text.append(1 + below(5), '\n');
+            break;
+        case 1: // blanks of every kind
+            for (size_t n = below(8) + 1; n > 0; --n) {
+                text += blanks[below(sizeof blanks)];
+            }
+            break;
+        case 2: { // a word near or beyond the cut
+            size_t length = 245 + below(12);
+            text.append(length, letters[below(sizeof letters)]);
+            break;
+        }
+        default: // a short word
+            for (size_t n = below(6) + 1; n > 0; --n) {
+                text += letters[below(sizeof letters)];
+            }
+            break;
+        }
+        if (below(3) == 0) {
+            text += '\n';
+        }
+    }
+    return text;
+}
+
+TEST_F(ControlFile, SplitOfEveryLineIsWhatSscanfGives) {
+    for (unsigned seed = 1; seed <= 400; ++seed) {
+        std::mt19937 random(seed);
+        const std::string text = random_control_text(random);
+        rec::reset();
+        reset_settings();
+        parse(text);
+        ASSERT_EQ(rec::traces_starting("TARNMNDF:    Input data"), traces_by_sscanf(text))
+            << "seed " << seed;
+        control_file_test::release_everything();
+    }
+}
+
+TEST_F(ControlFile, SplitAfterBlankRunsAndLongWordsIsWhatSscanfGives) {
+    const std::string texts[] = {
+        "\n\n\nA\n\n\nB\n",
+        "A\n\n\n" + std::string(300, 'w') + "\n\n\nB C\n",
+        "\t\r\n \v\f\n" + std::string(249, 'x') + " " + std::string(250, 'y') + "\nZ",
+        std::string(7, '\n') + "PROCESS_LOG_THRESHOLDS\n\n1\n\n2\n3 4\n\n" + std::string(260, 'p') +
+            "\nEND",
+        "A B C D E F G H I J K L M\n\n\nN\n",
+    };
+    for (const std::string &text : texts) {
+        rec::reset();
+        reset_settings();
+        parse(text);
+        EXPECT_EQ(rec::traces_starting("TARNMNDF:    Input data"), traces_by_sscanf(text)) << text;
+        control_file_test::release_everything();
+    }
 }
 
 TEST_F(ControlFile, CheckingIntervalBelowFiveBecomesSixty) {
