@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <random>
 #include <string>
@@ -258,6 +259,31 @@ TEST_F(ControlFile, NegativeSnapshotSizeWrapsAndIsComparedUnsigned) {
     EXPECT_EQ(max_snapshot_file_size, 4294966296u); // 0xFFFFFFFF x 1000, modulo 2^32
 }
 
+TEST_F(ControlFile, SnapshotSizeOfZeroIsRaisedToTheDataBlock) {
+    parse("MAX_SNAPSHOT_FILE_SIZE 0\n");
+    EXPECT_EQ(max_snapshot_file_size, 1545056u);
+}
+
+TEST_F(ControlFile, SnapshotSizeWhoseProductWrapsBelowTheFloorIsRaised) {
+    parse("MAX_SNAPSHOT_FILE_SIZE 4294968\n"); // x 1000 = 2^32 + 704
+    EXPECT_EQ(max_snapshot_file_size, 1545056u);
+    parse("MAX_SNAPSHOT_FILE_SIZE 4296513\n"); // x 1000 = 2^32 + 1545704
+    EXPECT_EQ(max_snapshot_file_size, 1545704u);
+}
+
+TEST_F(ControlFile, NegativeSnapshotSizeStaysAboveTheFloorAndIsTracedSigned) {
+    parse("MAX_SNAPSHOT_FILE_SIZE -1545\n");
+    EXPECT_EQ(max_snapshot_file_size, 4293422296u); // 2^32 - 1,545,000
+    EXPECT_TRUE(rec::has_trace("TARNMNDF: max_snapshot_file_size = -1545000 bytes"));
+}
+
+TEST_F(ControlFile, SnapshotSizeBeyondTheRangeIsTheLargestNumberTimes1000) {
+    parse("MAX_SNAPSHOT_FILE_SIZE 99999999999\n");
+    EXPECT_EQ(max_snapshot_file_size, 4294966296u); // 2147483647 x 1000, modulo 2^32
+    parse("MAX_SNAPSHOT_FILE_SIZE -99999999999\n");
+    EXPECT_EQ(max_snapshot_file_size, 1545056u); // -2147483648 x 1000 is 0 modulo 2^32
+}
+
 TEST_F(ControlFile, SnapshotSizeAbsentStaysZero) {
     parse("ACTUALLY_RUN\n");
     EXPECT_EQ(max_snapshot_file_size, 0u);
@@ -286,6 +312,56 @@ TEST_F(ControlFile, NumbersAreReadAsAtoiReadsThem) {
     EXPECT_EQ(low_free_size, -7);
     EXPECT_EQ(rss_memory_threshold, 0);
     EXPECT_EQ(vsz_memory_threshold, 0);
+}
+
+TEST_F(ControlFile, NumbersReadAsAtoiReadsThemInRange) {
+    const char *const words_read[] = {"0",
+                                      "+0",
+                                      "-0",
+                                      "007",
+                                      "12abc",
+                                      "-",
+                                      "+",
+                                      "--5",
+                                      "+-5",
+                                      "-+5",
+                                      "x1",
+                                      "2147483647",
+                                      "-2147483648",
+                                      "1e3",
+                                      "\xa0"
+                                      "5",
+                                      "99,5"};
+    for (const char *word : words_read) {
+        reset_settings();
+        parse(std::string("MIN_SWAP_SIZE ") + word + "\n");
+        EXPECT_EQ(min_swap_size, std::atoi(word)) << word;
+        control_file_test::release_everything();
+    }
+}
+
+TEST_F(ControlFile, NumbersBeyondTheRangeStopAtItsEnds) {
+    parse("MIN_SWAP_SIZE 2147483648\nLOW_FREE_SIZE 99999999999999999999999999\n"
+          "RSS_MEMORY_THRESHOLD -2147483649\nVSZ_ABORT_MEMORY_THRESHOLD -99999999999999999999\n"
+          "CPU_TIME_THRESHOLD 00000000000000000000000000042\n"
+          "PROCESS_LOG_THRESHOLDS 4294967296 -4294967296 4294967396 99999999999 a\n"
+          "PROCESS_ABORT_THRESHOLDS 2147483648 -2147483649 18446744073709551617 b\n");
+    EXPECT_EQ(min_swap_size, INT32_MAX);
+    EXPECT_EQ(low_free_size, INT32_MAX);
+    EXPECT_EQ(rss_memory_threshold, INT32_MIN);
+    EXPECT_EQ(vsz_abort_memory_threshold, INT32_MIN);
+    EXPECT_EQ(cpu_time_threshold, 42);
+    EXPECT_TRUE(rec::has_trace("TARNMNDF: min_swap_size = 2147483647 KB"));
+    EXPECT_TRUE(rec::has_trace("TARNMNDF: rss_memory_threshold = -2147483648 KB"));
+    ASSERT_EQ(logtable[0].compiled, 1u);
+    EXPECT_EQ(logtable[0].rss_limit, INT32_MAX);
+    EXPECT_EQ(logtable[0].dsiz_limit, INT32_MIN);
+    EXPECT_EQ(logtable[0].vsize_limit, INT32_MAX);
+    EXPECT_EQ(logtable[0].memoryCheckFlag, INT32_MAX);
+    ASSERT_EQ(aborttable[0].compiled, 1u);
+    EXPECT_EQ(aborttable[0].rss_abort_limit, INT32_MAX);
+    EXPECT_EQ(aborttable[0].dsiz_abort_limit, INT32_MIN);
+    EXPECT_EQ(aborttable[0].vsize_abort_limit, INT32_MAX);
 }
 
 TEST_F(ControlFile, KeywordsAreCaseSensitive) {

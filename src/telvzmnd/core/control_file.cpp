@@ -1,6 +1,6 @@
 #include "core/control_file.h"
 
-#include <cstdlib>
+#include <algorithm>
 #include <cstring>
 #include <string_view>
 
@@ -85,6 +85,26 @@ class word_splitter {
     const char *last_first_word = nullptr;
 };
 
+// A number word as atoi reads it: leading blanks and a sign, then digits up to the first other
+// character; a word without digits is 0. A number beyond the 32-bit range, where atoi gives no
+// defined value, reads as the nearest end of the range, so that a huge limit stays a huge limit.
+int32_t read_number(const char *word) {
+    constexpr int64_t beyond_range = int64_t{INT32_MAX} + 1;
+    const char *at = word;
+    while (is_blank(*at)) {
+        ++at;
+    }
+    bool negative = *at == '-';
+    if (*at == '-' || *at == '+') {
+        ++at;
+    }
+    int64_t magnitude = 0;
+    for (; *at >= '0' && *at <= '9'; ++at) {
+        magnitude = std::min(magnitude * 10 + (*at - '0'), beyond_range);
+    }
+    return static_cast<int32_t>(negative ? -magnitude : std::min(magnitude, beyond_range - 1));
+}
+
 // Copies at most `limit` characters of `from` into the zeroed field `to`.
 void copy_into_zeroed(char *to, const char *from, size_t limit) {
     std::memcpy(to, from, strnlen(from, limit));
@@ -119,25 +139,25 @@ bool is_comment(const char *line_start) {
 void apply_setting(const setting &entry, const char *value) {
     switch (entry.handling) {
     case setting_handling::plain:
-        *entry.value = std::atoi(value);
+        *entry.value = read_number(value);
         break;
     case setting_handling::flag:
         *entry.value = 1;
         break;
     case setting_handling::checking_interval:
         if (manualStart != 1) {
-            int32_t seconds = std::atoi(value);
+            int32_t seconds = read_number(value);
             *entry.value = seconds < CHECKING_INTERVAL_MIN ? CHECKING_INTERVAL_DEFAULT : seconds;
         }
         break;
     case setting_handling::capped_count: {
-        int32_t count = std::atoi(value);
+        int32_t count = read_number(value);
         *entry.value = count > TREND_SAMPLES_MAX ? TREND_SAMPLES_MAX : count;
         break;
     }
     case setting_handling::snapshot_size: {
         // Computed and compared unsigned: a negative value wraps to a large size, as it always has.
-        uint32_t bytes = static_cast<uint32_t>(std::atoi(value)) * SNAPSHOT_SIZE_UNIT;
+        uint32_t bytes = static_cast<uint32_t>(read_number(value)) * SNAPSHOT_SIZE_UNIT;
         *entry.unsigned_value = bytes < PRIMARY_DATA_BLOCK_SIZE
                                     ? static_cast<uint32_t>(PRIMARY_DATA_BLOCK_SIZE)
                                     : bytes;
@@ -257,18 +277,18 @@ void second_pass_line(const char *line_start, int32_t line, second_pass_state &r
     } else if (keyword == KEYWORD_LOG_THRESHOLDS && rows.log_row < num_log_thresholds) {
         log_threshold &row = logtable[rows.log_row];
         if (compile_row(row, words[5], 0, line)) {
-            row.rss_limit = std::atoi(words[1]);
-            row.dsiz_limit = std::atoi(words[2]);
-            row.vsize_limit = std::atoi(words[3]);
-            row.memoryCheckFlag = std::atoi(words[4]);
+            row.rss_limit = read_number(words[1]);
+            row.dsiz_limit = read_number(words[2]);
+            row.vsize_limit = read_number(words[3]);
+            row.memoryCheckFlag = read_number(words[4]);
             ++rows.log_row;
         }
     } else if (keyword == KEYWORD_ABORT_THRESHOLDS && rows.abort_row < num_abort_thresholds) {
         abort_threshold &row = aborttable[rows.abort_row];
         if (compile_row(row, words[4], REG_NOSUB, line)) {
-            row.rss_abort_limit = std::atoi(words[1]);
-            row.dsiz_abort_limit = std::atoi(words[2]);
-            row.vsize_abort_limit = std::atoi(words[3]);
+            row.rss_abort_limit = read_number(words[1]);
+            row.dsiz_abort_limit = read_number(words[2]);
+            row.vsize_abort_limit = read_number(words[3]);
             ++rows.abort_row;
         }
     }
