@@ -107,6 +107,21 @@ class SnapshotFile : public ::testing::Test {
 
 // ---- staging ----
 
+TEST_F(SnapshotFile, SeparatorsAreFiftyTwoCharactersAndOnlyThePlainOpeningHoldsTheMarker) {
+    EXPECT_EQ(PROBLEM_SNAPSHOT_OPENING, "=START FEDC SNAPSHOT" + std::string(32, '='));
+    EXPECT_EQ(PROBLEM_SNAPSHOT_CLOSING, "=END FEDC SNAPSHOT" + std::string(34, '='));
+    EXPECT_EQ(PLAIN_SNAPSHOT_OPENING, "=START" + std::string(46, '='));
+    EXPECT_EQ(PLAIN_SNAPSHOT_CLOSING, "=END" + std::string(48, '='));
+    EXPECT_EQ(WRAP_MARKER, "=START=");
+    for (std::string_view separator : {PROBLEM_SNAPSHOT_OPENING, PROBLEM_SNAPSHOT_CLOSING,
+                                       PLAIN_SNAPSHOT_OPENING, PLAIN_SNAPSHOT_CLOSING}) {
+        EXPECT_EQ(separator.size(), 52u);
+        EXPECT_EQ(separator.find(WRAP_MARKER) == 0, separator == PLAIN_SNAPSHOT_OPENING);
+        EXPECT_EQ(separator.find(WRAP_MARKER) == std::string_view::npos,
+                  separator != PLAIN_SNAPSHOT_OPENING);
+    }
+}
+
 TEST_F(SnapshotFile, StagesALineWithLineFeedThenCarriageReturn) {
     EXPECT_EQ(save("first"), "");
     EXPECT_EQ(save("second"), "");

@@ -33,7 +33,7 @@ extern time_t (*snapshot_clock)(time_t *);
 // Stages the NUL-terminated line `data` (followed by "\n\r") in `buffer` of `buffer_size` bytes
 // and, when `final` is 1 or the line does not fit, writes the staged text to the snapshot file.
 // `data` and `buffer` are consumed: their first byte is NUL once the line was staged or flushed. A
-// NULL `data` does nothing at all.
+// NULL `data` is only traced: nothing is staged or flushed.
 TARN_EXPORT void tarn_save_data(char *data, char *buffer, int32_t buffer_size, int32_t final);
 
 // Stages the two lines that follow every opening separator: the local date and time, and the code
