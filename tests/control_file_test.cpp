@@ -451,6 +451,18 @@ TEST_F(ControlFile, LogExpressionsKeepSubexpressionsAbortOnesDoNot) {
     EXPECT_EQ(regexec(&aborttable[0].expression, "AB+C", 0, nullptr, 0), REG_NOMATCH);
 }
 
+TEST_F(ControlFile, ExpressionsTreatALineFeedAsAnOrdinaryCharacter) {
+    // Without REG_NEWLINE, '^' and '$' hold only at the ends of the whole name.
+    parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 ^db$\nPROCESS_ABORT_THRESHOLDS 1 2 3 ^db$\n");
+    ASSERT_EQ(logtable[0].compiled, 1u);
+    ASSERT_EQ(aborttable[0].compiled, 1u);
+    for (const regex_t *expression : {&logtable[0].expression, &aborttable[0].expression}) {
+        EXPECT_EQ(regexec(expression, "db", 0, nullptr, 0), 0);
+        EXPECT_EQ(regexec(expression, "x\ndb", 0, nullptr, 0), REG_NOMATCH);
+        EXPECT_EQ(regexec(expression, "db\nx", 0, nullptr, 0), REG_NOMATCH);
+    }
+}
+
 TEST_F(ControlFile, TableLineWithTooFewWordsTakesTheRestFromTheNextLines) {
     parse("PROCESS_ABORT_THRESHOLDS 100 200\n300 ^x$\nPROCESS_LOG_THRESHOLDS 5\n"
           "CHECKING_INTERVAL 30\n");
@@ -877,6 +889,27 @@ TEST_F(ControlFile, LogTableAllocationFails) {
     EXPECT_EQ(rec::events()[0].record.comp_rc, 0u);
     EXPECT_EQ(rec::calls(rec::Call::get_func_addr2), 0); // no second pass: nothing resolved
     EXPECT_TRUE(rec::has_trace("TARNOTHF: Log table is NULL"));
+    // The abort table is still allocated after the failure, and left unfilled.
+    EXPECT_EQ(rec::calls(rec::Call::malloc), 3);
+    ASSERT_NE(aborttable, nullptr);
+    EXPECT_EQ(aborttable[0].compiled, 0u);
+    ASSERT_NE(calllist1, nullptr);
+    EXPECT_STREQ(calllist1[0].name, "");
+}
+
+TEST_F(ControlFile, AbortTableIsAllocatedLast) {
+    rec::fail(rec::Call::malloc, 0, 0, 2, 1);
+    EXPECT_EQ(parse("PROCESS_ABORT_THRESHOLDS 1 2 3 b\nPROCESS_LOG_THRESHOLDS 1 2 3 1 a\n"
+                    "EXTERNAL_CHECKING_ROUTINE m f\n"),
+              8u);
+    EXPECT_EQ(crc, 0xE088u);
+    EXPECT_EQ(aborttable, nullptr);
+    EXPECT_NE(calllist1, nullptr);
+    EXPECT_NE(logtable, nullptr);
+    ASSERT_EQ(rec::events().size(), 1u);
+    EXPECT_EQ(rec::events()[0].record.reason_code, 0xE088);
+    EXPECT_EQ(rec::events()[0].record.comp_rc, 0u);
+    EXPECT_TRUE(rec::traces_starting("TARNMNDF:  second pass").empty());
 }
 
 TEST_F(ControlFile, AbortTableAllocationFails) {
