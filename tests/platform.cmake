@@ -12,7 +12,8 @@ target_link_libraries(platform_leaker PRIVATE telvplatform)
 
 tarn_platform_test(platform_test
   SOURCES platform_files_test.cpp platform_trace_test.cpp platform_event_test.cpp
-          platform_memory_test.cpp platform_module_test.cpp platform_test_support.cpp
+          platform_memory_test.cpp platform_module_test.cpp platform_boundary_test.cpp
+          platform_test_support.cpp
   LIBRARIES telvplatform)
 target_compile_definitions(platform_test PRIVATE
   TELV_TEST_MODULE_DIR="$<TARGET_FILE_DIR:telvtestmodule>"

@@ -5,11 +5,16 @@
 #include "named_files.h"
 #include "platform_export.h"
 
+using telv::api::serve;
+using telv::data_files::FAILED;
+
 TELV_PLATFORM_EXPORT uint32_t filesvc_search_file_open(const char *name, uint32_t open_mode,
                                                        uint32_t access, uint32_t, uint32_t,
                                                        filesvc_handle_t *handle, uint32_t *info,
                                                        uint32_t *crc) {
-    return telv::named_files::open(name, open_mode, access, handle, info, crc);
+    return serve(FAILED, crc, [&] {
+        return telv::named_files::open(name, open_mode, access, handle, info, crc);
+    });
 }
 
 TELV_PLATFORM_EXPORT uint32_t filesvc_random_read(filesvc_handle_t handle, void *buffer,
@@ -19,7 +24,9 @@ TELV_PLATFORM_EXPORT uint32_t filesvc_random_read(filesvc_handle_t handle, void 
     if (info != nullptr) {
         *info = 0;
     }
-    return telv::data_files::read(handle, buffer, length, mode, offset, bytes_read, crc);
+    return serve(FAILED, crc, [&] {
+        return telv::data_files::read(handle, buffer, length, mode, offset, bytes_read, crc);
+    });
 }
 
 TELV_PLATFORM_EXPORT uint32_t filesvc_random_write(filesvc_handle_t handle, const void *buffer,
@@ -29,18 +36,20 @@ TELV_PLATFORM_EXPORT uint32_t filesvc_random_write(filesvc_handle_t handle, cons
     if (info != nullptr) {
         *info = 0;
     }
-    return telv::data_files::write(handle, buffer, length, mode, offset, bytes_written, crc);
+    return serve(FAILED, crc, [&] {
+        return telv::data_files::write(handle, buffer, length, mode, offset, bytes_written, crc);
+    });
 }
 
 TELV_PLATFORM_EXPORT uint32_t filesvc_query_file_size(const char *name, uint32_t *size,
                                                       uint32_t *crc) {
-    return telv::named_files::query_size(name, size, crc);
+    return serve(FAILED, crc, [&] { return telv::named_files::query_size(name, size, crc); });
 }
 
 TELV_PLATFORM_EXPORT uint32_t filesvc_delete_file(const char *name, uint32_t *crc) {
-    return telv::named_files::remove(name, crc);
+    return serve(FAILED, crc, [&] { return telv::named_files::remove(name, crc); });
 }
 
 TELV_PLATFORM_EXPORT uint32_t filesvc_close_file(filesvc_handle_t handle, uint32_t *crc) {
-    return telv::data_files::close(handle, crc);
+    return serve(FAILED, crc, [&] { return telv::data_files::close(handle, crc); });
 }

@@ -5,5 +5,6 @@
 #include "platform_export.h"
 
 TELV_PLATFORM_EXPORT uint32_t logsvc_microcode_log(void *record, uint32_t *crc) {
-    return telv::event_log::log(record, crc);
+    return telv::api::serve(telv::event_log::FAILED, crc,
+                            [&] { return telv::event_log::log(record, crc); });
 }

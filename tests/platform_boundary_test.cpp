@@ -1,0 +1,147 @@
+// What every service of the default platform owes its caller, whatever happens inside: errno as
+// it was, and an answer rather than a throw.
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <string>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "filesvc.h"
+#include "logsvc.h"
+#include "memsvc.h"
+#include "modsvc.h"
+#include "platform_test_support.h"
+#include "telvmemdebug.h"
+#include "tracesvc.h"
+
+namespace {
+
+using platform_test::set_variable;
+using PlatformBoundary = platform_test::PlatformTest;
+
+logsvc_record event_record() {
+    logsvc_record record;
+    std::memset(&record, 0, sizeof record);
+    record.record_type = LOGSVC_RECORD_TYPE_EVENT;
+    record.option = LOGSVC_REPORT_ERROR;
+    std::memcpy(record.component, "LinMonitor", 10);
+    return record;
+}
+
+// A caller that saw a call fail with EINTR traces and then looks at errno again.
+TEST_F(PlatformBoundary, FailingServicesLeaveErrnoAsTheyFoundIt) {
+    set_variable("TELV_TRACE_FILE", dir + "/missing/x.trace");
+    set_variable("TELV_EVENT_LOG", dir + "/missing/x.events");
+
+    errno = EINTR;
+    EXPECT_EQ(tracesvc_trace("TARNERRF: %s", "lost"), -1);
+    EXPECT_EQ(errno, EINTR);
+    EXPECT_EQ(tracesvc_dump_bytes("TARNERRF: lost", "ab", 2), -1);
+    EXPECT_EQ(errno, EINTR);
+
+    int foreign = 0;
+    telvmemdebug_free(&foreign, "boundary", 1); // traced, into the missing trace file
+    EXPECT_EQ(errno, EINTR);
+
+    logsvc_record record = event_record();
+    uint32_t crc = 0;
+    EXPECT_EQ(logsvc_microcode_log(&record, &crc), 8u);
+    EXPECT_EQ(crc, static_cast<uint32_t>(ENOENT));
+    EXPECT_EQ(errno, EINTR);
+
+    void *address = &foreign;
+    void *handle = &foreign;
+    EXPECT_EQ(modsvc_get_func_addr2("telvnosuchmodule", "f", &address, &handle, &crc), 8u);
+    EXPECT_EQ(errno, EINTR);
+
+    filesvc_handle_t file = 0;
+    uint32_t info = 0;
+    EXPECT_EQ(filesvc_search_file_open("absent", 0, 1, 0, 0, &file, &info, &crc), 8u);
+    EXPECT_EQ(crc, static_cast<uint32_t>(ENOENT));
+    EXPECT_EQ(errno, EINTR);
+    uint32_t size = 0;
+    EXPECT_EQ(filesvc_query_file_size("absent", &size, &crc), 8u);
+    EXPECT_EQ(errno, EINTR);
+
+    EXPECT_EQ(memsvc_ckptr(nullptr, 4), 8u);
+    EXPECT_EQ(memsvc_ckptr(&foreign, sizeof foreign), 0u);
+    EXPECT_EQ(errno, EINTR);
+
+    void *block = telvmemdebug_malloc(16, "boundary", 2);
+    EXPECT_NE(block, nullptr);
+    EXPECT_EQ(errno, EINTR);
+    telvmemdebug_free(block, "boundary", 3);
+    EXPECT_EQ(errno, EINTR);
+}
+
+#ifndef TARN_SANITIZED
+// The blocks taken by exhaust_memory, chained through their first word, so that none is dropped.
+void *volatile taken_blocks = nullptr;
+
+// Takes every byte the heap can still give, so that the next allocation fails: first the large
+// blocks, then each small size, since the allocator keeps freed small blocks apart by size.
+void exhaust_memory() {
+    auto take_all = [](size_t size) {
+        for (void *block = std::malloc(size); block != nullptr; block = std::malloc(size)) {
+            *static_cast<void **>(block) = taken_blocks;
+            taken_blocks = block;
+        }
+    };
+    for (size_t size = size_t{1} << 20; size >= 4096; size /= 2) {
+        take_all(size);
+    }
+    for (size_t size = 4096; size >= sizeof(void *); size -= sizeof(void *)) {
+        take_all(size);
+    }
+}
+
+long address_space_in_use() {
+    std::ifstream statm("/proc/self/statm");
+    long pages = 0;
+    statm >> pages;
+    return pages * ::sysconf(_SC_PAGESIZE);
+}
+#endif
+
+// With the address space capped and the heap used up, every service that needs memory for a path
+// or a line refuses instead of throwing into a host that cannot catch it.
+TEST_F(PlatformBoundary, MemoryRunningOutInsideAServiceIsARefusal) {
+#ifdef TARN_SANITIZED
+    GTEST_SKIP() << "the sanitizers' shadow memory needs an address space without a cap";
+#else
+    logsvc_record record = event_record();
+    long in_use = address_space_in_use();
+    ASSERT_GT(in_use, 0);
+    pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        struct rlimit cap = {static_cast<rlim_t>(in_use + (64L << 20)),
+                             static_cast<rlim_t>(in_use + (64L << 20))};
+        if (::setrlimit(RLIMIT_AS, &cap) != 0) {
+            ::_exit(100);
+        }
+        exhaust_memory();
+        int wrong = 0;
+        errno = EINTR;
+        wrong |= tracesvc_trace("TARNOOMF: %s", "no room") != -1 ? 1 : 0;
+        int local = 0;
+        wrong |= memsvc_ckptr(&local, sizeof local) != 8 ? 2 : 0;
+        uint32_t crc = 0;
+        wrong |= logsvc_microcode_log(&record, &crc) != 8 || crc != ENOMEM ? 4 : 0;
+        crc = 0;
+        uint32_t size = 0;
+        wrong |= filesvc_query_file_size("absent", &size, &crc) != 8 || crc != ENOMEM ? 8 : 0;
+        wrong |= telvmemdebug_malloc(8, "boundary", 1) != nullptr || errno != ENOMEM ? 16 : 0;
+        ::_exit(wrong);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+#endif
+}
+
+} // namespace
