@@ -209,6 +209,8 @@ TEST_F(CheckConfig, RoutineThatCannotBeResolved) {
     EXPECT_TRUE(contains(result.out, "the monitor reports 0xE086 and does not run\n"))
         << result.out;
     EXPECT_TRUE(contains(result.out, "  0: tarn_no_such_check  NOT resolved\n")) << result.out;
+    // Told in words only: the event log of the appliance gets no event from a check.
+    EXPECT_FALSE(platform_test::exists(event_path()));
 }
 
 TEST_F(CheckConfig, RuleThatFailsIsNamedWithValueRuleAndUnit) {
