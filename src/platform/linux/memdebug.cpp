@@ -50,8 +50,12 @@ void *remember(void *block, size_t size, const char *file, int line) {
 // Blocks still live when the process ends (or the platform is unloaded) are reported when the
 // environment asks for it.
 __attribute__((destructor)) void report_at_exit() {
-    if (environment::text(REPORT_VARIABLE, "0") == "1") {
-        report_leaks(stderr);
+    // Memory may be short at exit too; then the report is skipped rather than thrown into exit.
+    try {
+        if (environment::text(REPORT_VARIABLE, "0") == "1") {
+            report_leaks(stderr);
+        }
+    } catch (...) {
     }
 }
 
