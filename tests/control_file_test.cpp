@@ -315,23 +315,9 @@ TEST_F(ControlFile, NumbersAreReadAsAtoiReadsThem) {
 }
 
 TEST_F(ControlFile, NumbersReadAsAtoiReadsThemInRange) {
-    const char *const words_read[] = {"0",
-                                      "+0",
-                                      "-0",
-                                      "007",
-                                      "12abc",
-                                      "-",
-                                      "+",
-                                      "--5",
-                                      "+-5",
-                                      "-+5",
-                                      "x1",
-                                      "2147483647",
-                                      "-2147483648",
-                                      "1e3",
-                                      "\xa0"
-                                      "5",
-                                      "99,5"};
+    const char *const words_read[] = {
+        "0",   "+0",  "-0", "007",        "12abc",       "-",   "+",        "--5",
+        "+-5", "-+5", "x1", "2147483647", "-2147483648", "1e3", "\xa0\x35", "99,5"};
     for (const char *word : words_read) {
         reset_settings();
         parse(std::string("MIN_SWAP_SIZE ") + word + "\n");
