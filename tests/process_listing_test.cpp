@@ -191,6 +191,20 @@ TEST_F(ProcessListing, HalfASecondIsMeasuredInFractionsOfATick) {
     EXPECT_EQ(process_list.sample_ticks[1], 1017);
 }
 
+TEST_F(ProcessListing, ASampleIndexOutsideTheRingCountsModuloTheRing) {
+    update_process_list(&process_list);
+    process_list.current_sample = INT32_MAX; // slot 7
+    process_list.sample_ticks[6] = 1000;
+    update_after(100);
+    EXPECT_EQ(process_list.sample_ticks[7], 1100);
+    EXPECT_EQ(process_list.current_sample, 8);
+
+    process_list.current_sample = INT32_MAX - 2; // slot 5: the newest column is slot 4
+    process_list.sample_ticks[4] = 4444;
+    process_list.sample_ticks[5] = 5555;
+    EXPECT_TRUE(print_to_text().starts_with("checks: |      +4444|")) << print_to_text();
+}
+
 TEST_F(ProcessListing, UpdateWithinHalfASecondIsSkippedAndChangesNothing) {
     tree->set_process(7, "init", 10, 4);
     update_process_list(&process_list);

@@ -86,6 +86,7 @@ int32_t pid_of_name(const char *name) {
     return value < INT32_MIN || value > INT32_MAX ? 0 : static_cast<int32_t>(value);
 }
 
+// The ring slot of a sample index; any index counts modulo the ring, the largest ones too.
 int ring_slot(int32_t sample) {
     return ((sample % PROCESS_SAMPLES) + PROCESS_SAMPLES) % PROCESS_SAMPLES;
 }
@@ -186,7 +187,7 @@ struct table_row {
         std::snprintf(text, sizeof text, "%s", label);
     }
     static int slot_of_column(const process_list_header *list, int k) {
-        return ring_slot(list->current_sample + PROCESS_SAMPLES - 1 - k);
+        return ring_slot(ring_slot(list->current_sample) + PROCESS_SAMPLES - 1 - k);
     }
     char *cell(int k) { return text + first_column + CELL_STRIDE * k; }
     size_t room(int k) const {
@@ -379,7 +380,7 @@ TARN_EXPORT void update_process_list(process_list_header *list) {
         sample_entry(list, cursor, cur, prev, diff);
     }
     directory.reset();
-    list->current_sample = ring_slot(list->current_sample + 1);
+    list->current_sample = ring_slot(cur + 1);
     tracesvc_trace("TARNCPUF: <-update_process_list");
 }
 
