@@ -205,6 +205,27 @@ TEST_F(ProcessListing, ASampleIndexOutsideTheRingCountsModuloTheRing) {
     EXPECT_TRUE(print_to_text().starts_with("checks: |      +4444|")) << print_to_text();
 }
 
+TEST_F(ProcessListing, NoTimeElapsedGivesZeroShares) {
+    reset_process_listing_state();
+    fake::fake_proc no_rate(1000, -1); // the tick rate could not be read
+    no_rate.set_cpus(1);
+    no_rate.set_process(100, "busy", 10, 7);
+    update_process_list(&process_list);
+    EXPECT_EQ(process_list.sample_ticks[9], 1000); // 1000 + 0.6, truncated
+    no_rate.set_process(100, "busy", 60, 9);
+    rec::clear_traces();
+    update_process_list(&process_list); // the same tick: diff 0, yet -0.5 is not above it
+
+    EXPECT_EQ(rec::traces(), (Traces{enter,
+                                     "TARNCPUF: query_number_of_cpus: found number 0, "
+                                     "new total: 1",
+                                     leave}));
+    EXPECT_EQ(process_list.current_sample, 2);
+    EXPECT_EQ(entry_of(100)->user_jiffies[1], 60u);
+    EXPECT_EQ(entry_of(100)->user_percent[1], 0.0f);
+    EXPECT_EQ(entry_of(100)->kernel_percent[1], 0.0f);
+}
+
 TEST_F(ProcessListing, UpdateWithinHalfASecondIsSkippedAndChangesNothing) {
     tree->set_process(7, "init", 10, 4);
     update_process_list(&process_list);
