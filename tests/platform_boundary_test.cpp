@@ -1,5 +1,6 @@
 // What every service of the default platform owes its caller, whatever happens inside: errno as
 // it was, and an answer rather than a throw.
+#include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -7,7 +8,9 @@
 #include <string>
 #include <sys/resource.h>
 #include <sys/wait.h>
+#include <thread>
 #include <unistd.h>
+#include <vector>
 
 #include "filesvc.h"
 #include "logsvc.h"
@@ -75,6 +78,44 @@ TEST_F(PlatformBoundary, FailingServicesLeaveErrnoAsTheyFoundIt) {
     EXPECT_EQ(errno, EINTR);
     telvmemdebug_free(block, "boundary", 3);
     EXPECT_EQ(errno, EINTR);
+}
+
+// Events logged by many threads at once each stay one whole line.
+TEST_F(PlatformBoundary, EventsOfManyThreadsAreWholeLines) {
+    constexpr int THREADS = 6;
+    constexpr int EVENTS = 40;
+    std::vector<std::thread> threads;
+    std::atomic<int> refused{0};
+    for (int t = 0; t < THREADS; ++t) {
+        threads.emplace_back([t, &refused] {
+            std::string attachment(3000, static_cast<char>('a' + t));
+            logsvc_record record = event_record();
+            record.attachment = attachment.data();
+            record.attachment_length = static_cast<uint32_t>(attachment.size());
+            for (int e = 0; e < EVENTS; ++e) {
+                uint32_t crc = 0;
+                refused += logsvc_microcode_log(&record, &crc) == 0 ? 0 : 1;
+            }
+        });
+    }
+    for (std::thread &thread : threads) {
+        thread.join();
+    }
+    EXPECT_EQ(refused.load(), 0);
+    std::vector<std::string> lines = platform_test::read_lines(event_path());
+    ASSERT_EQ(lines.size(), static_cast<size_t>(THREADS * EVENTS));
+    std::vector<int> per_thread(THREADS, 0);
+    for (const std::string &line : lines) {
+        size_t at = line.find("\"attachment\":\"");
+        ASSERT_NE(at, std::string::npos) << line;
+        std::string text = line.substr(at + 14);
+        int t = text.empty() ? -1 : text[0] - 'a';
+        ASSERT_TRUE(t >= 0 && t < THREADS) << line;
+        EXPECT_EQ(text, std::string(3000, static_cast<char>('a' + t)) + "\"}");
+        EXPECT_TRUE(line.starts_with("{\"time\":\"")) << line;
+        ++per_thread[static_cast<size_t>(t)];
+    }
+    EXPECT_EQ(per_thread, std::vector<int>(THREADS, EVENTS));
 }
 
 #ifndef TARN_SANITIZED

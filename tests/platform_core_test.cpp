@@ -1,4 +1,5 @@
 // The hidden core of the default platform: the pieces that work on text and tables alone.
+#include <atomic>
 #include <cerrno>
 #include <cstdint>
 #include <cstdlib>
@@ -6,7 +7,9 @@
 #include <fcntl.h>
 #include <string>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
+#include <vector>
 
 #include "environment.h"
 #include "event_log.h"
@@ -256,6 +259,41 @@ TEST_F(PlatformCoreBlocks, ForeignAndRepeatedFreesLeaveTheTableAlone) {
 TEST_F(PlatformCoreBlocks, CallocOverflowTakesNothing) {
     size_t before = telv::memdebug::live_blocks();
     EXPECT_EQ(telv::memdebug::allocate_zeroed(SIZE_MAX / 4, 8, "t", 1), nullptr);
+    EXPECT_EQ(telv::memdebug::live_blocks(), before);
+}
+
+TEST_F(PlatformCoreBlocks, ThreadsAllocatingAtOnceKeepEveryBlockApart) {
+    constexpr int THREADS = 8;
+    constexpr int ROUNDS = 500;
+    size_t before = telv::memdebug::live_blocks();
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < THREADS; ++t) {
+        threads.emplace_back([t, &wrong] {
+            std::vector<void *> held;
+            for (int round = 0; round < ROUNDS; ++round) {
+                void *block = round % 2 == 0 ? telv::memdebug::allocate(16, "thread", t)
+                                             : telv::memdebug::allocate_zeroed(2, 8, "thread", t);
+                std::memset(block, t, 16);
+                held.push_back(block);
+                if (round % 3 == 2) {
+                    telv::memdebug::release(held.front(), "thread", t);
+                    held.erase(held.begin());
+                }
+            }
+            for (void *block : held) {
+                telv::memdebug::Block found{};
+                bool ours = telv::memdebug::find(block, &found) && found.line == t &&
+                            found.size == 16 && static_cast<unsigned char *>(block)[15] == t;
+                wrong += ours ? 0 : 1;
+                telv::memdebug::release(block, "thread", t);
+            }
+        });
+    }
+    for (std::thread &thread : threads) {
+        thread.join();
+    }
+    EXPECT_EQ(wrong.load(), 0);
     EXPECT_EQ(telv::memdebug::live_blocks(), before);
 }
 
