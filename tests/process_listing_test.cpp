@@ -678,7 +678,13 @@ TEST_F(ProcessListing, HostileStatFilesAreSampledWithoutHarm) {
     tree->set_stat_text(100, "garbage");
     rec::clear_traces();
     update_after(100);
-    EXPECT_EQ(rec::traces_starting("TARNCPUF: update_process_list:").size(), 2u);
+    EXPECT_EQ(rec::traces_starting("TARNCPUF: update_process_list:"),
+              (Traces{"TARNCPUF: update_process_list: user percentage invalid: 21474832.000000, "
+                      "pid: 100, current jiffies: 0, previous jiffies: 10, hertz: 100, diff: 100, "
+                      "cpus: 2",
+                      "TARNCPUF: update_process_list: kernel percentage invalid: 21474832.000000, "
+                      "pid: 100, current jiffies: 0, previous jiffies: 10, hertz: 100, diff: 100, "
+                      "cpus: 2"}));
     EXPECT_EQ(entry_of(100)->user_percent[2], 0.0f);
     EXPECT_STREQ(entry_of(100)->process_name, "(fine)");
 }
