@@ -75,11 +75,11 @@ extern int32_t manualStart; // 1 when the checking interval came from the host, 
 
 // What the parser does with the second word of a keyword's line.
 enum class setting_handling : uint8_t {
-    plain,             // atoi of the word
+    plain,             // the word's number, read as atoi reads it
     flag,              // no value: the keyword alone sets 1
-    checking_interval, // atoi, below 5 becomes 60; the line is ignored when manualStart is 1
-    capped_count,      // atoi, above TREND_SAMPLES_MAX becomes TREND_SAMPLES_MAX
-    snapshot_size,     // atoi x 1000 bytes, floored (unsigned) at the size of primaryDataBlock
+    checking_interval, // number, below 5 becomes 60; the line is ignored when manualStart is 1
+    capped_count,      // number, above TREND_SAMPLES_MAX becomes TREND_SAMPLES_MAX
+    snapshot_size,     // number x 1000 bytes, floored (unsigned) at the size of primaryDataBlock
     row_counter,       // a table keyword: the first pass only counts its lines
 };
 
