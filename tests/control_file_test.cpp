@@ -806,14 +806,19 @@ TEST_F(ControlFile, TracesOfTheTablesAndTheirDumps) {
     ASSERT_GE(first, 0);
     EXPECT_EQ(traces_from(first, expected.size() + 1), expected);
 
-    // One dump of 64 bytes of each compiled expression, log rows first, in row order.
+    // One dump of 64 bytes of each compiled expression, each closing its row's lines.
     ASSERT_EQ(rec::dumps().size(), 3u);
     const regex_t *dumped[] = {&logtable[0].expression, &logtable[1].expression,
                                &aborttable[0].expression};
+    const char *const last_line_of_row[] = {"TARNOTHF:   memoryCheckFlag is 1",
+                                            "TARNOTHF:   memoryCheckFlag is 0",
+                                            "TARNOTHF:   vsize abort threshold is 6"};
     for (size_t i = 0; i < 3; ++i) {
         EXPECT_EQ(rec::dumps()[i].title, "TARNOTHF: compiled regular expression is: ");
         EXPECT_EQ(rec::dumps()[i].bytes,
                   std::string(reinterpret_cast<const char *>(dumped[i]), 64));
+        EXPECT_EQ(rec::dumps()[i].after_traces,
+                  static_cast<size_t>(rec::find_trace(last_line_of_row[i])) + 1);
     }
 }
 

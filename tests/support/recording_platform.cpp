@@ -308,7 +308,8 @@ int tracesvc_dump_bytes(const char *title, const void *data, uint32_t length) {
     std::lock_guard guard(s.lock);
     s.dumps.push_back(
         rec::Dump{title != nullptr ? title : "",
-                  std::string(static_cast<const char *>(data), data != nullptr ? length : 0)});
+                  std::string(static_cast<const char *>(data), data != nullptr ? length : 0),
+                  s.traces.size()});
     return 0;
 }
 

@@ -3,6 +3,7 @@
 // files from a temporary directory, and fails any chosen call with a chosen return code.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -42,6 +43,7 @@ struct Event {
 struct Dump {
     std::string title;
     std::string bytes;
+    size_t after_traces; // how many trace lines came before it
 };
 
 const std::vector<std::string> &traces();
