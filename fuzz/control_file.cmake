@@ -4,9 +4,6 @@ set(TARN_CONTROL_FILE_FUZZ_SOURCES
     core/control_file.cpp core/settings.cpp core/validation.cpp core/problem_reporting.cpp
     core/control_block.cpp data_blocks.cpp)
 list(TRANSFORM TARN_CONTROL_FILE_FUZZ_SOURCES PREPEND ${PROJECT_SOURCE_DIR}/src/telvzmnd/)
-add_executable(fuzz_control_file control_file.cpp support/quiet_platform.cpp
-               ${TARN_CONTROL_FILE_FUZZ_SOURCES})
-target_include_directories(fuzz_control_file PRIVATE ${PROJECT_SOURCE_DIR}/src/telvzmnd
-                                                     ${PROJECT_SOURCE_DIR}/src/platform)
+tarn_fuzz_target(control_file control_file.cpp support/quiet_platform.cpp
+                 ${TARN_CONTROL_FILE_FUZZ_SOURCES})
 target_compile_options(fuzz_control_file PRIVATE -fno-exceptions -fno-rtti)
-target_link_options(fuzz_control_file PRIVATE -fsanitize=fuzzer,address,undefined)
