@@ -225,6 +225,8 @@ TEST_F(ControlFile, CheckingIntervalIgnoredWhenTheHostGaveOne) {
     checking_interval = 17;
     parse("CHECKING_INTERVAL 30\nCHECKING_INTERVAL 2\n");
     EXPECT_EQ(checking_interval, 17);
+    EXPECT_TRUE(rec::has_trace("TARNMNDF: checking_interval = 17 seconds"));
+    EXPECT_EQ(manualStart, 1);
 }
 
 TEST_F(ControlFile, TrendAnalysisPointsCappedAt24) {
