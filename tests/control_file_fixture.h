@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <vector>
 
 #include "core/control_file.h"
 #include "core/settings.h"
@@ -44,7 +45,7 @@ class ControlFileTest : public ::testing::Test {
 };
 
 // The trace line of the first pass for the 12 words given (missing ones empty).
-inline std::string input_line(const char *prefix, std::initializer_list<std::string> given) {
+inline std::string input_line(const char *prefix, const std::vector<std::string> &given) {
     std::string line = prefix;
     size_t n = 0;
     for (const auto &word : given) {
@@ -57,11 +58,11 @@ inline std::string input_line(const char *prefix, std::initializer_list<std::str
     return line;
 }
 
-inline std::string first_pass(std::initializer_list<std::string> given) {
+inline std::string first_pass(const std::vector<std::string> &given) {
     return input_line("TARNMNDF:    Input data = ", given);
 }
 
-inline std::string second_pass(std::initializer_list<std::string> given) {
+inline std::string second_pass(const std::vector<std::string> &given) {
     return input_line("TARNMNDF:  second pass Input data = ", given);
 }
 

@@ -129,12 +129,7 @@ std::vector<std::string> traces_by_sscanf(const std::string &text) {
     std::vector<std::string> lines;
     const char *all = text.c_str();
     for (const char *start = all; const char *end = std::strchr(start, '\n'); start = end + 1) {
-        std::string line = "TARNMNDF:    Input data = ";
-        const auto split = words_as_sscanf_splits(start);
-        for (size_t n = 0; n < split.size(); ++n) {
-            line += (n == 0 ? "[" : " [") + split[n] + "]";
-        }
-        lines.push_back(line);
+        lines.push_back(first_pass(words_as_sscanf_splits(start)));
     }
     return lines;
 }
