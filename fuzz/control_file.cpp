@@ -31,7 +31,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         text[CONTROL_FILE_MAX - 1] = '\0';
     }
     reset_settings();
-    tarn_settings_start_values();
+    settings_start_values();
     uint32_t crc = 0;
     tarn_parse_control_file(text.data(), &crc);
     if (trend_analysis_points > TREND_SAMPLES_MAX ||
@@ -39,7 +39,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         checking_interval < CHECKING_INTERVAL_MIN) {
         __builtin_trap();
     }
-    tarn_validate_settings();
+    validate_settings();
     release_everything();
     return 0;
 }

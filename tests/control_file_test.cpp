@@ -399,7 +399,7 @@ TEST_F(ControlFile, InvalidFirstLogExpressionIsOverwrittenByTheNextRow) {
 
     // The dropped row is remembered for the checker.
     control_file_tables tables{};
-    tarn_control_file_tables(&tables);
+    read_control_file_tables(&tables);
     ASSERT_EQ(tables.problem_count, 1);
     EXPECT_EQ(tables.problems[0].kind, control_file_problem_kind::uncompiled_expression);
     EXPECT_EQ(tables.problems[0].line, 1);
@@ -950,7 +950,7 @@ TEST_F(ControlFile, RoutineThatCannotBeResolved) {
               "TARNOTHF: <-- tarn_parse_control_file(), src = 8, crc = 2 (hex)");
 
     control_file_tables tables{};
-    tarn_control_file_tables(&tables);
+    read_control_file_tables(&tables);
     ASSERT_EQ(tables.problem_count, 1);
     EXPECT_EQ(tables.problems[0].kind, control_file_problem_kind::unresolved_routine);
     EXPECT_STREQ(tables.problems[0].first, "nomodule");
@@ -1018,7 +1018,7 @@ TEST_F(ControlFile, ResetSettingsRestoresLoadTimeValues) {
 
 TEST_F(ControlFile, ExportedSettingsTableIsTheParsersTable) {
     size_t count = 0;
-    const setting *table = tarn_settings_table(&count);
+    const setting *table = settings_table(&count);
     EXPECT_EQ(table, SETTINGS);
     EXPECT_EQ(count, 56u); // 53 settings and 3 table keywords
 }

@@ -86,14 +86,14 @@ class Validation : public ::testing::Test {
 };
 
 TEST_F(Validation, AllValidPasses) {
-    EXPECT_EQ(tarn_validate_settings(), nullptr);
+    EXPECT_EQ(validate_settings(), nullptr);
     EXPECT_TRUE(rec::traces().empty());
     EXPECT_TRUE(rec::events().empty());
 }
 
 TEST_F(Validation, NothingSetFailsOnTheFirstRule) {
     reset_settings();
-    const setting *failed = tarn_validate_settings();
+    const setting *failed = validate_settings();
     ASSERT_NE(failed, nullptr);
     EXPECT_EQ(failed->keyword, "MINIMUM_JAVA_FREE_SPACE");
     EXPECT_EQ(failed->rule->text, "must be from 11 to 1000");
@@ -104,12 +104,12 @@ TEST_F(Validation, NothingSetFailsOnTheFirstRule) {
 TEST_F(Validation, RulesAreCheckedInTheMonitorsOrder) {
     reset_settings();
     for (int32_t *value : CHECKED_IN_ORDER) {
-        const setting *failed = tarn_validate_settings();
+        const setting *failed = validate_settings();
         ASSERT_NE(failed, nullptr);
         EXPECT_EQ(failed->value, value) << failed->keyword;
         *value = 500;
     }
-    EXPECT_EQ(tarn_validate_settings(), nullptr);
+    EXPECT_EQ(validate_settings(), nullptr);
 }
 
 TEST_F(Validation, PercentRangeBoundaries) {
@@ -123,13 +123,13 @@ TEST_F(Validation, PercentRangeBoundaries) {
         ASSERT_NE(entry, nullptr);
         int32_t kept = *value;
         *value = 10;
-        EXPECT_EQ(tarn_validate_settings(), entry) << entry->keyword;
+        EXPECT_EQ(validate_settings(), entry) << entry->keyword;
         *value = 11;
-        EXPECT_EQ(tarn_validate_settings(), nullptr) << entry->keyword;
+        EXPECT_EQ(validate_settings(), nullptr) << entry->keyword;
         *value = 1000;
-        EXPECT_EQ(tarn_validate_settings(), nullptr) << entry->keyword;
+        EXPECT_EQ(validate_settings(), nullptr) << entry->keyword;
         *value = 1001;
-        EXPECT_EQ(tarn_validate_settings(), entry) << entry->keyword;
+        EXPECT_EQ(validate_settings(), entry) << entry->keyword;
         *value = kept;
     }
 }
@@ -142,11 +142,11 @@ TEST_F(Validation, AtLeast11Boundaries) {
             continue;
         }
         *value = 10;
-        EXPECT_EQ(tarn_validate_settings(), entry) << entry->keyword;
+        EXPECT_EQ(validate_settings(), entry) << entry->keyword;
         *value = 11;
-        EXPECT_EQ(tarn_validate_settings(), nullptr) << entry->keyword;
+        EXPECT_EQ(validate_settings(), nullptr) << entry->keyword;
         *value = INT32_MAX; // no upper bound
-        EXPECT_EQ(tarn_validate_settings(), nullptr) << entry->keyword;
+        EXPECT_EQ(validate_settings(), nullptr) << entry->keyword;
         *value = 500;
     }
 }
@@ -185,53 +185,53 @@ const low_bound LOW_BOUNDS[] = {
 TEST_F(Validation, SmallLowerBounds) {
     for (const low_bound &bound : LOW_BOUNDS) {
         *bound.value = bound.failing;
-        const setting *failed = tarn_validate_settings();
+        const setting *failed = validate_settings();
         ASSERT_NE(failed, nullptr) << bound.keyword;
         EXPECT_EQ(failed->keyword, bound.keyword);
         EXPECT_EQ(failed->rule->text, bound.rule);
         *bound.value = bound.passing;
-        EXPECT_EQ(tarn_validate_settings(), nullptr) << bound.keyword;
+        EXPECT_EQ(validate_settings(), nullptr) << bound.keyword;
     }
 }
 
 TEST_F(Validation, ComparisonsAreSigned) {
     low_free_size = -1;
-    EXPECT_EQ(tarn_validate_settings(), entry_of(&low_free_size));
+    EXPECT_EQ(validate_settings(), entry_of(&low_free_size));
     low_free_size = 1;
     minimum_java_free_space = INT32_MIN;
-    EXPECT_EQ(tarn_validate_settings(), entry_of(&minimum_java_free_space));
+    EXPECT_EQ(validate_settings(), entry_of(&minimum_java_free_space));
 }
 
 TEST_F(Validation, ResumeJavaBelowMinimumJavaFreeSpaceFails) {
     minimum_java_free_space = 100;
     resume_java_log_on_percent = 99;
-    const setting *failed = tarn_validate_settings();
+    const setting *failed = validate_settings();
     ASSERT_NE(failed, nullptr);
     EXPECT_EQ(failed->keyword, "RESUME_JAVA_LOG_ON_PERCENT");
     EXPECT_EQ(failed->rule->cross, cross_check::not_below);
     EXPECT_EQ(failed->rule->other, &minimum_java_free_space);
     EXPECT_EQ(failed->rule->text, "must be from 11 to 1000 and not below MINIMUM_JAVA_FREE_SPACE");
     resume_java_log_on_percent = 100;
-    EXPECT_EQ(tarn_validate_settings(), nullptr);
+    EXPECT_EQ(validate_settings(), nullptr);
 }
 
 TEST_F(Validation, ResumeMemoryAboveTotalMemoryFails) {
     total_memory_percent_threshold = 900;
     resume_memory_percent_threshold = 901;
-    const setting *failed = tarn_validate_settings();
+    const setting *failed = validate_settings();
     ASSERT_NE(failed, nullptr);
     EXPECT_EQ(failed->keyword, "RESUME_MEMORY_PERCENT_THRESHOLD");
     EXPECT_EQ(failed->rule->cross, cross_check::not_above);
     EXPECT_EQ(failed->rule->other, &total_memory_percent_threshold);
     resume_memory_percent_threshold = 900;
-    EXPECT_EQ(tarn_validate_settings(), nullptr);
+    EXPECT_EQ(validate_settings(), nullptr);
 }
 
 TEST_F(Validation, EarlierRuleWinsOverALaterOne) {
     // LOW_FREE_SIZE comes before NUM_THREADS_THRESHOLD among the keywords, after it when checked.
     low_free_size = 0;
     num_threads_threshold = 0;
-    EXPECT_EQ(tarn_validate_settings(), entry_of(&num_threads_threshold));
+    EXPECT_EQ(validate_settings(), entry_of(&num_threads_threshold));
 }
 
 TEST_F(Validation, SettingsWithoutARuleAreNotChecked) {
@@ -246,15 +246,15 @@ TEST_F(Validation, SettingsWithoutARuleAreNotChecked) {
     trend_analysis_points = -5;
     trend_analysis_num_increases = -5;
     checking_interval = -5;
-    EXPECT_EQ(tarn_validate_settings(), nullptr);
+    EXPECT_EQ(validate_settings(), nullptr);
 }
 
 TEST_F(Validation, RunRequestedOnlyWhenActuallyRunIsOne) {
-    EXPECT_EQ(tarn_run_requested(), 0);
+    EXPECT_EQ(run_requested(), 0);
     actuallyRun = 1;
-    EXPECT_EQ(tarn_run_requested(), 1);
+    EXPECT_EQ(run_requested(), 1);
     actuallyRun = 2;
-    EXPECT_EQ(tarn_run_requested(), 0);
+    EXPECT_EQ(run_requested(), 0);
 }
 
 } // namespace

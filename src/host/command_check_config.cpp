@@ -88,7 +88,7 @@ const char *read_problem(const control_text &text) {
 
 void print_settings() {
     size_t count = 0;
-    const setting *table = tarn_settings_table(&count);
+    const setting *table = settings_table(&count);
     std::printf("Settings:\n");
     for (size_t i = 0; i < count; ++i) {
         const setting &entry = table[i];
@@ -194,11 +194,11 @@ int command_check_config(command_args args) {
     // running monitor raised.
     setenv(EVENT_LOG_VARIABLE, "/dev/null", 1);
     // As monitoring starts without a checking interval from its host.
-    tarn_settings_start_values();
+    settings_start_values();
     uint32_t crc = 0;
     uint32_t src = tarn_parse_control_file(text.bytes.data(), &crc);
     control_file_tables tables{};
-    tarn_control_file_tables(&tables);
+    read_control_file_tables(&tables);
     print_settings();
     print_tables(tables);
     std::printf("\n");
@@ -210,12 +210,12 @@ int command_check_config(command_args args) {
                     crc);
         ++problems;
     }
-    if (tarn_run_requested() == 0) {
+    if (run_requested() == 0) {
         std::printf("PROBLEM: ACTUALLY_RUN is missing; the monitor runs only when the file holds "
                     "a line starting with it\n");
         ++problems;
     }
-    if (const setting *failed = tarn_validate_settings()) {
+    if (const setting *failed = validate_settings()) {
         print_rule_failure(*failed);
         ++problems;
     }

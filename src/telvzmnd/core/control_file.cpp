@@ -416,7 +416,7 @@ void release_control_file_tables(uint32_t *crc) {
     }
 }
 
-TARN_EXPORT void tarn_control_file_tables(control_file_tables *tables) {
+void read_control_file_tables(control_file_tables *tables) {
     tables->calls = calllist1;
     tables->call_count = num_external_calls;
     tables->log_rows = logtable;

@@ -84,7 +84,7 @@ struct control_file_problem {
 
 inline constexpr int CONTROL_FILE_PROBLEMS_KEPT = 16;
 
-// The tables and problems of the last parse, for hosts that cannot see the globals themselves.
+// The tables and problems of the last parse in one piece, for the checker of control files.
 struct control_file_tables {
     const external_call *calls;
     int32_t call_count;
@@ -96,4 +96,4 @@ struct control_file_tables {
     int32_t problem_count;                // all of them
 };
 
-TARN_EXPORT void tarn_control_file_tables(control_file_tables *tables);
+void read_control_file_tables(control_file_tables *tables);

@@ -108,7 +108,7 @@ void reset_settings() {
     manualStart = 0;
 }
 
-TARN_EXPORT void tarn_settings_start_values(void) {
+void settings_start_values(void) {
     checking_interval = CHECKING_INTERVAL_DEFAULT;
     snapshot_interval = 0;
     trend_analysis_points = 0;
@@ -118,7 +118,7 @@ TARN_EXPORT void tarn_settings_start_values(void) {
     num_abort_thresholds = 0;
 }
 
-TARN_EXPORT const setting *tarn_settings_table(size_t *count) {
+const setting *settings_table(size_t *count) {
     if (count != nullptr) {
         *count = SETTING_COUNT;
     }

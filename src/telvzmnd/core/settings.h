@@ -330,7 +330,7 @@ void reset_settings();
 // What monitoring sets before it reads the control file: the checking interval, the snapshot
 // interval and the two trend settings get their defaults, the row counts 0; every other setting
 // keeps what it has.
-TARN_EXPORT void tarn_settings_start_values(void);
+void settings_start_values(void);
 
-// The table for hosts, which cannot see the globals themselves: *count gets its length.
-TARN_EXPORT const setting *tarn_settings_table(size_t *count);
+// The whole table, for the checker of control files: *count gets its length.
+const setting *settings_table(size_t *count);

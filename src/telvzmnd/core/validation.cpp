@@ -40,7 +40,7 @@ static_assert(sequence_is_complete(), "check_order must number the rules 1, 2, .
 
 } // namespace
 
-TARN_EXPORT int32_t tarn_run_requested(void) {
+int32_t run_requested(void) {
     return actuallyRun == 1 ? 1 : 0;
 }
 
@@ -59,7 +59,7 @@ bool setting_is_valid(const setting &entry) {
     return valid;
 }
 
-TARN_EXPORT const setting *tarn_validate_settings(void) {
+const setting *validate_settings(void) {
     const setting *failed = nullptr;
     for (size_t index : CHECKING_SEQUENCE) {
         if (!setting_is_valid(SETTINGS[index])) {

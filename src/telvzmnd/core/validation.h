@@ -6,11 +6,11 @@
 #include "export.h"
 
 // 1 when the file asked the monitor to run (ACTUALLY_RUN), else 0; checked before the rules.
-TARN_EXPORT int32_t tarn_run_requested(void);
+int32_t run_requested(void);
 
 // Whether one setting passes its rule (a setting without a rule always does).
 bool setting_is_valid(const setting &entry);
 
 // The first setting whose rule fails, in the monitor's order of checking, or null when every rule
 // holds. Traces nothing: a failing rule ends the monitor silently.
-TARN_EXPORT const setting *tarn_validate_settings(void);
+const setting *validate_settings(void);
