@@ -14,7 +14,7 @@ for target in "$dir"/fuzz/fuzz_*; do
   seeds=()
   [ -d "$top/fuzz/corpus/$name" ] && seeds=("$top/fuzz/corpus/$name")
   echo "fuzzing $name for ${seconds}s"
-  "$target" -max_total_time="$seconds" -max_len=100000 -print_final_stats=1 \
+  "$target" -max_total_time="$seconds" -max_len=100000 -rss_limit_mb=4096 -print_final_stats=1 \
     "$work" "${seeds[@]}" 2>&1 | tail -n 12
   rm -rf "$work"
 done
