@@ -1,7 +1,10 @@
 // The data-file service of the default platform: named files in the data directory.
 #include <cerrno>
 #include <string>
+#include <string_view>
 #include <sys/stat.h>
+#include <thread>
+#include <vector>
 
 #include "filesvc.h"
 #include "platform_test_support.h"
@@ -243,6 +246,33 @@ TEST_F(PlatformDataFiles, AFreedHandleIsGivenOutAgain) {
     EXPECT_EQ(third, first);
     close(second);
     close(third);
+}
+
+TEST_F(PlatformDataFiles, AppendsThroughTwoHandlesAtOnceLoseNothing) {
+    constexpr int APPENDS = 2000;
+    const std::string lines[2] = {std::string(63, 'a') + "\n", std::string(63, 'b') + "\n"};
+    filesvc_handle_t handles[2] = {open_file("shared"), open_file("shared")};
+    std::vector<std::thread> writers;
+    for (int w = 0; w < 2; ++w) {
+        writers.emplace_back([&, w] {
+            for (int i = 0; i < APPENDS; ++i) {
+                uint32_t written = 0, info = 0, crc = 0;
+                filesvc_random_write(handles[w], lines[w].data(), 64, FILESVC_APPEND, 0, &written,
+                                     &info, &crc);
+            }
+        });
+    }
+    for (auto &writer : writers) {
+        writer.join();
+    }
+    std::string text = read_file(dir + "/shared");
+    ASSERT_EQ(text.size(), 2u * APPENDS * 64);
+    for (size_t at = 0; at < text.size(); at += 64) {
+        std::string_view line(text.data() + at, 64);
+        ASSERT_TRUE(line == lines[0] || line == lines[1]) << "torn line at " << at;
+    }
+    close(handles[0]);
+    close(handles[1]);
 }
 
 } // namespace

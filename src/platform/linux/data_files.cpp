@@ -4,6 +4,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <mutex>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 #include <vector>
@@ -33,6 +34,25 @@ std::string path_of(const std::string &directory, const char *name) {
     return directory + "/" + name;
 }
 
+// Holds an exclusive lock on a file for its lifetime; fd -1 holds nothing.
+class file_lock {
+  public:
+    explicit file_lock(int fd) : fd_(fd) {
+        while (fd_ >= 0 && ::flock(fd_, LOCK_EX) != 0 && errno == EINTR) {
+        }
+    }
+    ~file_lock() {
+        if (fd_ >= 0) {
+            ::flock(fd_, LOCK_UN);
+        }
+    }
+    file_lock(const file_lock &) = delete;
+    file_lock &operator=(const file_lock &) = delete;
+
+  private:
+    int fd_;
+};
+
 int descriptor_of(filesvc_handle_t handle) {
     std::lock_guard guard(table_lock);
     if (handle == 0 || handle > descriptors.size()) {
@@ -61,11 +81,13 @@ uint32_t open(const std::string &directory, const char *name, uint32_t open_mode
     } else if (open_mode != FILESVC_OPEN_EXISTING) {
         return fail(crc, EINVAL);
     }
+    std::lock_guard guard(table_lock);
+    // Room for the handle first, so that a descriptor is never opened without a place to keep it.
+    descriptors.reserve(descriptors.size() + 1);
     int fd = ::open(path_of(directory, name).c_str(), flags, 0644);
     if (fd < 0) {
         return fail(crc, errno);
     }
-    std::lock_guard guard(table_lock);
     size_t slot = 0;
     while (slot < descriptors.size() && descriptors[slot] >= 0) {
         ++slot;
@@ -124,6 +146,9 @@ uint32_t write(filesvc_handle_t handle, const void *buffer, uint32_t length, uin
         return fail(crc, EINVAL);
     }
     off_t position = offset;
+    // Appenders through other handles, here or in another process, take the same lock, so that
+    // no two of them find the same end and write over each other.
+    file_lock append_lock(mode == FILESVC_APPEND ? fd : -1);
     if (mode == FILESVC_APPEND) {
         struct stat st;
         if (::fstat(fd, &st) != 0) {
