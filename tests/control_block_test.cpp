@@ -1,12 +1,15 @@
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <set>
 #include <string>
 #include <sys/ipc.h>
 #include <sys/sem.h>
 #include <sys/shm.h>
 #include <sys/wait.h>
+#include <thread>
 #include <unistd.h>
 #include <vector>
 
@@ -22,12 +25,11 @@ struct Script {
     std::vector<int> shmget_results; // consumed one per call; empty = the real call
     std::vector<int> shmget_errors;
     int shmat_calls = 0;
-    int shmdt_calls = 0;
     void *shmat_result = nullptr;
     bool fake_shmat = false;
     int shmctl_result = 0;
     int shmctl_error = 0;
-    bool fake_shmctl = false;
+    bool fake_shmctl = false; // of IPC_RMID
     std::vector<int> semget_results;
     std::vector<int> semget_errors;
     int semop_eintr = 0; // calls that fail with EINTR before the real ones
@@ -54,13 +56,9 @@ void *fake_shmat(int id, const void *address, int flags) {
     return sysv_ipc_system.shmat(id, address, flags);
 }
 
-int fake_shmdt(const void *address) {
-    script.shmdt_calls++;
-    return sysv_ipc_system.shmdt(address);
-}
-
+// Fakes the removal only: the size check of an attach still asks the kernel.
 int fake_shmctl(int id, int command, struct shmid_ds *buffer) {
-    if (script.fake_shmctl) {
+    if (script.fake_shmctl && command == IPC_RMID) {
         errno = script.shmctl_error;
         return script.shmctl_result;
     }
@@ -134,7 +132,7 @@ class ControlBlock : public ::testing::Test {
         shmctl(first, IPC_RMID, nullptr);
         rec::reset();
         script = Script{};
-        sysv_ipc = {fake_shmget, fake_shmat, fake_shmdt, fake_shmctl, fake_semget, fake_semop};
+        sysv_ipc = {fake_shmget, fake_shmat, fake_shmctl, fake_semget, fake_semop};
     }
     void TearDown() override {
         sysv_ipc = sysv_ipc_system;
@@ -381,17 +379,22 @@ TEST_F(ControlBlock, RepeatedAttachReusesTheMapping) {
     tarn_init_tarn_cb_ptr(&unused);
     EXPECT_EQ(TARN_CB_PTR, first);
     EXPECT_EQ(script.shmat_calls, attaches);
-    EXPECT_EQ(script.shmdt_calls, 0);
     EXPECT_EQ(rec::traces_starting("TARNICBF: about to get memory pointer").size(), 2u);
 }
 
-TEST_F(ControlBlock, NewSegmentDetachesTheOldMapping) {
+TEST_F(ControlBlock, NewSegmentLeavesTheOldMappingInPlace) {
     ASSERT_EQ(init(), 0u);
     int first_id = shmid;
+    tarn_control_block *first = TARN_CB_PTR;
+    first->maxSleepTime = 77;
     ASSERT_EQ(init(), 0u);
     EXPECT_NE(shmid, first_id);
-    EXPECT_EQ(script.shmdt_calls, 1);
+    EXPECT_NE(TARN_CB_PTR.get(), first);
     EXPECT_EQ(script.shmat_calls, 2);
+    // Another thread that read the old address may go on using it.
+    EXPECT_EQ(first->maxSleepTime, 77);
+    EXPECT_EQ(TARN_CB_PTR->maxSleepTime, 0);
+    shmdt(first);
 }
 
 TEST_F(ControlBlock, AnotherProcessAttachesAndSeesTheFields) {
@@ -550,6 +553,94 @@ TEST_F(ControlBlock, SemaphoreFailureOtherThanExistsIsNotReported) {
     EXPECT_TRUE(rec::events().empty());
     EXPECT_TRUE(rec::has_trace("TARNINTD: semget's errrc = 1c (hex)"));
     EXPECT_TRUE(rec::has_trace("TARNINTD: About to do a semop to unlock the semaphore, Point A"));
+}
+
+TEST_F(ControlBlock, ASegmentOfAnotherSizeUnderTheKeyIsNoBlockAndIsNeverWritten) {
+    constexpr size_t FOREIGN_SIZE = 4000000;
+    int foreign = shmget(static_cast<key_t>(TARN_CB_KEY), FOREIGN_SIZE, IPC_CREAT | 0666);
+    ASSERT_NE(foreign, -1);
+    auto *bytes = static_cast<unsigned char *>(shmat(foreign, nullptr, 0));
+    ASSERT_NE(bytes, reinterpret_cast<unsigned char *>(-1));
+    TARN_CB_PTR = nullptr;
+    uint32_t unused = 0;
+    EXPECT_EQ(tarn_init_tarn_cb_ptr(&unused), 0u);
+    EXPECT_EQ(TARN_CB_PTR, nullptr);
+    EXPECT_EQ(script.shmat_calls, 0);
+    EXPECT_EQ(rec::traces_starting("TARNICBF: shmid = ffffffff (hex)").size(), 10u);
+    EXPECT_EQ(rec::traces_starting("TARNICBF: shmget failed").size(), 10u);
+
+    rec::clear_traces();
+    tarn_terminate_monitoring();
+    EXPECT_TRUE(all_zero(bytes, FOREIGN_SIZE));
+    ASSERT_EQ(rec::events().size(), 1u);
+    EXPECT_EQ(rec::events()[0].record.reason_code, 0xE170);
+    shmdt(bytes);
+}
+
+TEST_F(ControlBlock, InitReplacesALargerSegmentUnderTheKey) {
+    int foreign = shmget(static_cast<key_t>(TARN_CB_KEY), 4000000, IPC_CREAT | 0666);
+    ASSERT_NE(foreign, -1);
+    EXPECT_EQ(init(), 0u);
+    EXPECT_NE(shmid, foreign);
+    EXPECT_EQ(segment_size(shmid), 2940036u);
+}
+
+// A host thread that reads the block while another attaches in a loop, and another process that
+// makes a new block again and again: every address a reader took must stay mapped.
+TEST_F(ControlBlock, ReadersSurviveAttachesWhileAnotherProcessRemakesTheBlock) {
+    sysv_ipc = sysv_ipc_system; // the fakes keep their script without a lock
+    ASSERT_EQ(init(), 0u);
+    int go[2];
+    ASSERT_EQ(pipe(go), 0);
+    pid_t remaker = start_child([&] {
+        close(go[1]);
+        char byte = 0;
+        if (read(go[0], &byte, 1) != 1) {
+            return 1;
+        }
+        for (int i = 0; i < 120; ++i) {
+            uint32_t child_crc = 0;
+            if (tarn_init(&child_crc) != 0) {
+                return 2;
+            }
+            TARN_CB_PTR->terminateRequest = static_cast<uint32_t>(i);
+        }
+        return 0;
+    });
+    close(go[0]);
+
+    std::atomic<bool> done{false};
+    std::atomic<long> reads{0};
+    std::thread reader([&] {
+        while (!done.load()) {
+            tarn_control_block *block = TARN_CB_PTR;
+            if (block != nullptr) {
+                volatile uint32_t seen = read_field(block->terminateRequest);
+                (void)seen;
+                reads.fetch_add(1);
+            }
+        }
+    });
+    std::set<tarn_control_block *> addresses;
+    std::thread attacher([&] {
+        while (!done.load()) {
+            uint32_t unused = 0;
+            tarn_init_tarn_cb_ptr(&unused);
+            addresses.insert(TARN_CB_PTR.get());
+            rec::clear_traces();
+        }
+    });
+    char byte = 'G';
+    ASSERT_EQ(write(go[1], &byte, 1), 1);
+    int status = wait_child(remaker);
+    done.store(true);
+    reader.join();
+    attacher.join();
+    close(go[1]);
+    EXPECT_EQ(status, 0);
+    EXPECT_GT(reads.load(), 0);
+    // The attacher followed the block from segment to segment.
+    EXPECT_GT(addresses.size(), 2u);
 }
 
 } // namespace

@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <mutex>
 
 #include "core/problem_reporting.h"
 #include "core/reason_codes.h"
@@ -9,12 +10,12 @@
 #include "logsvc.h"
 #include "tracesvc.h"
 
-const sysv_ipc_calls sysv_ipc_system = {::shmget, ::shmat, ::shmdt, ::shmctl, ::semget, ::semop};
+const sysv_ipc_calls sysv_ipc_system = {::shmget, ::shmat, ::shmctl, ::semget, ::semop};
 sysv_ipc_calls sysv_ipc = sysv_ipc_system;
 
 uint32_t shKey;
 int32_t shmid = -1;
-tarn_control_block *TARN_CB_PTR;
+control_block_pointer TARN_CB_PTR;
 
 namespace {
 
@@ -31,27 +32,45 @@ key_t key_of(uint32_t value) {
     return static_cast<key_t>(value);
 }
 
-// The id of the block's own mapping in this process: a repeated attach of the same segment reuses
-// it instead of mapping the 2.9 MB again.
+// Serialises the attaches of the threads of this process: shKey, shmid and the mapping below are
+// changed only while it is held.
+std::mutex attach_lock;
+
+// The segment whose mapping TARN_CB_PTR holds: a repeated attach of the same segment reuses it
+// instead of mapping the 2.9 MB again.
 int32_t attached_id = -1;
 
-// Attaches segment `id`, reusing this process's mapping of it; a mapping of an older segment is
-// detached first. A failed attach (-1, or a null address) leaves TARN_CB_PTR null.
+// shmget, accepting only a segment of exactly the control block's size: a larger segment under
+// the key belongs to another program, and nothing may be written into it. Such a segment counts
+// as no segment at all (-1, errno EINVAL, as shmget says of a size that does not fit).
+int find_segment(size_t size, int flags) {
+    int id = sysv_ipc.shmget(key_of(shKey), size, flags);
+    if (id == -1) {
+        return -1;
+    }
+    shmid_ds info;
+    if (sysv_ipc.shmctl(id, IPC_STAT, &info) != 0 || info.shm_segsz != TARN_CB_SIZE) {
+        errno = EINVAL;
+        return -1;
+    }
+    return id;
+}
+
+// Attaches segment `id`, reusing this process's mapping of it. The mapping of an older segment
+// stays in place, since another thread may still be using it. A failed attach (-1, or a null
+// address) leaves TARN_CB_PTR null.
 void attach(int32_t id) {
     if (TARN_CB_PTR != nullptr && attached_id == id) {
         return;
     }
-    if (TARN_CB_PTR != nullptr) {
-        sysv_ipc.shmdt(TARN_CB_PTR);
-        TARN_CB_PTR = nullptr;
-        attached_id = -1;
-    }
     void *address = sysv_ipc.shmat(id, nullptr, 0);
     if (address == reinterpret_cast<void *>(-1) || address == nullptr) {
+        attached_id = -1;
+        TARN_CB_PTR = nullptr;
         return;
     }
-    TARN_CB_PTR = static_cast<tarn_control_block *>(address);
     attached_id = id;
+    TARN_CB_PTR = static_cast<tarn_control_block *>(address);
 }
 
 // Applies unlockSem to the new set, again while a signal interrupts it. On a new set it fails with
@@ -71,6 +90,7 @@ void unlock_new_set(bool trace_each_try) {
 } // namespace
 
 TARN_EXPORT uint32_t tarn_init(uint32_t *crc) {
+    std::lock_guard guard(attach_lock);
     tracesvc_trace("TARNINTF: before shared memory access");
     shKey = TARN_CB_KEY;
     tracesvc_trace("TARNINTF: shKey = %x (hex)", shKey);
@@ -105,7 +125,7 @@ TARN_EXPORT uint32_t tarn_init(uint32_t *crc) {
             }
             tracesvc_trace("TARNINTF: before second shmget");
             errno = 0;
-            shmid = sysv_ipc.shmget(key_of(shKey), TARN_CB_SIZE, IPC_CREAT | 0666);
+            shmid = find_segment(TARN_CB_SIZE, IPC_CREAT | 0666);
             int second_error = errno;
             tracesvc_trace("TARNINTF: Point 0200 shmid = %x (hex), errno = %x (hex)", shmid,
                            second_error);
@@ -172,13 +192,14 @@ TARN_EXPORT uint32_t tarn_init(uint32_t *crc) {
 }
 
 TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *) {
+    std::lock_guard guard(attach_lock);
     shKey = TARN_CB_KEY;
     tracesvc_trace("TARNICBF: shKey = %x (hex)", shKey);
     // A block removed by a later run's tarn_init gets a new id: look it up again each time.
     shmid = -1;
     for (int attempt = 0; attempt < MAX_ATTEMPTS && shmid == -1; ++attempt) {
         tracesvc_trace("TARNICBF: before shmget");
-        shmid = sysv_ipc.shmget(key_of(shKey), TARN_CB_SIZE, 0666);
+        shmid = find_segment(TARN_CB_SIZE, 0666);
         tracesvc_trace("TARNICBF: shmid = %x (hex)", shmid);
         if (shmid != -1) {
             tracesvc_trace("TARNICBF: about to get memory pointer");
@@ -201,20 +222,20 @@ TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *) {
 
 TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock) {
     tracesvc_trace("TARNTLCF: --> tarn_override_table_lock_control(%d)", lock);
+    // Read once: another thread may attach a newer block meanwhile.
+    tarn_control_block *block = TARN_CB_PTR;
     int rc;
     int error_number;
     do {
-        tracesvc_trace("TARNTLCF: before TARN_CB_PTR->uBufferLock = %x (hex)",
-                       TARN_CB_PTR->uBufferLock);
+        tracesvc_trace("TARNTLCF: before TARN_CB_PTR->uBufferLock = %x (hex)", block->uBufferLock);
         bool locking = lock == 1;
         tracesvc_trace(locking ? "TARNTLCF: try to lock" : "TARNTLCF: try to unlock");
-        rc = sysv_ipc.semop(TARN_CB_PTR->uBufferLock, locking ? lockSem : unlockSem,
-                            locking ? 2 : 1);
+        rc = sysv_ipc.semop(block->uBufferLock, locking ? lockSem : unlockSem, locking ? 2 : 1);
         error_number = rc == -1 ? errno : 0;
         tracesvc_trace(locking
                            ? "TARNTLCF: after TARN_CB_PTR->uBufferLock (lock case) = %x (hex)"
                            : "TARNTLCF: after TARN_CB_PTR->uBufferLock (unlock case) = %x (hex)",
-                       TARN_CB_PTR->uBufferLock);
+                       block->uBufferLock);
         tracesvc_trace("TARNTLCF: osl_rc = %x (hex)", rc);
         tracesvc_trace("TARNTLCF: error_number = %x (hex)", error_number);
         // Unlocking a table that nobody holds counts as success.
@@ -222,8 +243,7 @@ TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock) {
             rc = 0;
             error_number = 0;
         }
-        tracesvc_trace("TARNTLCF: after TARN_CB_PTR->uBufferLock = %x (hex)",
-                       TARN_CB_PTR->uBufferLock);
+        tracesvc_trace("TARNTLCF: after TARN_CB_PTR->uBufferLock = %x (hex)", block->uBufferLock);
     } while (rc != 0 && error_number == EINTR);
     tracesvc_trace("TARNTLCF: <-- tarn_override_table_lock_control() == %d", rc);
     return rc;
@@ -232,8 +252,9 @@ TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock) {
 TARN_EXPORT void tarn_terminate_monitoring(void) {
     tracesvc_trace("TARNTERF: --> tarn_terminate_monitoring");
     uint32_t crc = 0;
-    if (tarn_init_tarn_cb_ptr(&crc) == 0 && TARN_CB_PTR != nullptr) {
-        TARN_CB_PTR->terminateRequest = 1;
+    tarn_control_block *block = tarn_init_tarn_cb_ptr(&crc) == 0 ? TARN_CB_PTR.get() : nullptr;
+    if (block != nullptr) {
+        write_field(block->terminateRequest, 1);
     }
     logsvc_record record;
     std::memset(&record, 0, sizeof record);

@@ -3,6 +3,7 @@
 // each offset below is an interface between processes and is pinned.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 
@@ -93,9 +94,37 @@ static_assert(offsetof(tarn_control_block, terminateRequest) == 2940028);
 static_assert(offsetof(tarn_control_block, logAsInfo) == 2940032);
 static_assert(sizeof(tarn_control_block) == TARN_CB_SIZE);
 
-extern uint32_t shKey;                  // key of the segment and of the semaphore set
-extern int32_t shmid;                   // id of the segment; -1 until one is found
-extern tarn_control_block *TARN_CB_PTR; // this process's attachment; null until attached
+// This process's attachment of the block. Any thread of the host may attach while others use the
+// block, so the address is published with one atomic store and read with one atomic load, and a
+// mapping, once made, is never removed while the process lives: an address that a thread has read
+// stays valid. A failed attach publishes null, so code that uses the block twice reads the pointer
+// once into a local first.
+class control_block_pointer {
+  public:
+    tarn_control_block *get() const { return address.load(std::memory_order_acquire); }
+    operator tarn_control_block *() const { return get(); }
+    tarn_control_block *operator->() const { return get(); }
+    control_block_pointer &operator=(tarn_control_block *block) {
+        address.store(block, std::memory_order_release);
+        return *this;
+    }
+
+  private:
+    std::atomic<tarn_control_block *> address{nullptr};
+};
+
+// A 32-bit field of the block that another thread or process writes while this one reads it:
+// one relaxed atomic access of the aligned word.
+inline uint32_t read_field(const uint32_t &field) {
+    return __atomic_load_n(&field, __ATOMIC_RELAXED);
+}
+inline void write_field(uint32_t &field, uint32_t value) {
+    __atomic_store_n(&field, value, __ATOMIC_RELAXED);
+}
+
+extern uint32_t shKey;                    // key of the segment and of the semaphore set
+extern int32_t shmid;                     // id of the segment; -1 until one is found
+extern control_block_pointer TARN_CB_PTR; // null until attached
 
 TARN_EXPORT uint32_t tarn_init(uint32_t *crc);
 TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *crc);

@@ -64,8 +64,9 @@ TARN_EXPORT uint32_t tarn_mon_error_handler_p(uint32_t sysRc, uint32_t compRc, c
         bool system = kind == report_class::system;
         record.record_type = LOGSVC_RECORD_TYPE_EVENT;
         record.option = LOGSVC_REPORT_ERROR;
-        if (!system && TARN_CB_PTR != nullptr) {
-            if (TARN_CB_PTR->logAsInfo != 0) {
+        const tarn_control_block *block = TARN_CB_PTR;
+        if (!system && block != nullptr) {
+            if (read_field(block->logAsInfo) != 0) {
                 record.option = LOGSVC_REPORT_INFORMATIONAL;
                 tracesvc_trace("TARNSLTF: LOGSVC_REPORT_INFORMATIONAL option set.");
             } else {

@@ -10,7 +10,6 @@
 struct sysv_ipc_calls {
     int (*shmget)(key_t key, size_t size, int flags);
     void *(*shmat)(int id, const void *address, int flags);
-    int (*shmdt)(const void *address);
     int (*shmctl)(int id, int command, struct shmid_ds *buffer);
     int (*semget)(key_t key, int count, int flags);
     int (*semop)(int id, struct sembuf *operations, size_t count);
