@@ -6,7 +6,7 @@ set -euo pipefail
 packages=(
   cmake ninja-build g++ clang libclang-rt-14-dev
   libgtest-dev libgmock-dev googletest libbenchmark-dev
-  binutils procps util-linux coreutils
+  binutils procps util-linux coreutils git
 )
 
 missing=()
