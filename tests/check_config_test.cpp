@@ -2,10 +2,15 @@
 // here, with the default platform's data directory in a fresh temporary directory.
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <string>
+#include <vector>
 
 #include "platform_test_support.h"
 
@@ -149,8 +154,18 @@ TEST_F(CheckConfig, MissingFile) {
 TEST_F(CheckConfig, UnreadableFile) {
     ChildResult result = check({dir}); // a directory opens but cannot be read
     EXPECT_EQ(result.exit_status, 1);
-    EXPECT_EQ(result.out, "PROBLEM: the control file " + dir +
-                              " cannot be read; the monitor reports 0xE081 and does not run\n");
+    EXPECT_EQ(result.out, "PROBLEM: the control file " + dir + " cannot be read (" +
+                              std::strerror(EISDIR) +
+                              "); the monitor reports 0xE081 and does not run\n");
+}
+
+TEST_F(CheckConfig, FileThatCannotBeOpened) {
+    std::string plain = write("plain", "x");
+    ChildResult result = check({plain + "/telvzopt.trm"});
+    EXPECT_EQ(result.exit_status, 3);
+    EXPECT_EQ(result.out, "PROBLEM: the control file " + plain +
+                              "/telvzopt.trm cannot be opened (" + std::strerror(ENOTDIR) +
+                              "); without it the monitor does not run (and reports nothing)\n");
 }
 
 TEST_F(CheckConfig, FileOfOneByte) {
@@ -260,6 +275,85 @@ TEST_F(CheckConfig, TooManyArguments) {
     ChildResult result = check({"a", "b"});
     EXPECT_EQ(result.exit_status, 2);
     EXPECT_EQ(result.err, "usage: tarnmon check-config [FILE]\n");
+}
+
+TEST_F(CheckConfig, HelpIsTheUsageOnStandardOutput) {
+    ChildResult result = check({"--help"});
+    EXPECT_EQ(result.exit_status, 0);
+    EXPECT_EQ(result.out.rfind("usage: tarnmon check-config [FILE]\n", 0), 0u) << result.out;
+    EXPECT_EQ(result.err, "");
+}
+
+TEST_F(CheckConfig, OptionsAndADashAreNoFileNames) {
+    for (const char *word : {"--bogus", "-", "-x"}) {
+        ChildResult result = check({word});
+        EXPECT_EQ(result.exit_status, 2) << word;
+        EXPECT_EQ(result.out, "") << word;
+        EXPECT_EQ(result.err, "usage: tarnmon check-config [FILE]\n") << word;
+    }
+}
+
+TEST_F(CheckConfig, AFileNameBeginningWithADashFollowsTheEndOfOptions) {
+    write("-name", example_text());
+    std::filesystem::path here = std::filesystem::current_path();
+    std::filesystem::current_path(dir);
+    ChildResult result = check({"--", "-name"});
+    std::filesystem::current_path(here);
+    EXPECT_EQ(result.exit_status, 0) << result.out << result.err;
+    EXPECT_TRUE(contains(result.out, "Control file: -name (")) << result.out;
+}
+
+// Bytes of the file that would drive a terminal: a title change ended by BEL, a screen clear.
+TEST_F(CheckConfig, ControlBytesOfTheFileAreShownEscaped) {
+    std::string text = example_with("EXTERNAL_CHECKING_ROUTINE",
+                                    "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_\x1b[2J\x07"
+                                    "check");
+    text += "PROCESS_LOG_THRESHOLDS 1 2 3 1 \x1b]0;owned\x07\n";
+    text += "PROCESS_ABORT_THRESHOLDS 1 2 3 \x1b[2J\n"; // an open bracket: does not compile
+    ChildResult result = check_text(text);
+    EXPECT_EQ(result.exit_status, 1);
+    for (const std::string *output : {&result.out, &result.err}) {
+        for (char c : *output) {
+            ASSERT_TRUE(static_cast<unsigned char>(c) >= 0x20 || c == '\n' || c == '\t')
+                << static_cast<int>(c) << " in " << *output;
+        }
+    }
+    EXPECT_TRUE(contains(result.out, "  0: tarn_\\x1b[2J\\x07check  NOT resolved\n")) << result.out;
+    EXPECT_TRUE(contains(result.out, "the routine tarn_\\x1b[2J\\x07check of module telvzmnd"))
+        << result.out;
+    EXPECT_TRUE(contains(result.out, "processes matching [\\x1b]0;owned\\x07]")) << result.out;
+    EXPECT_TRUE(contains(result.out, "the process name expression [\\x1b[2J] of "
+                                     "PROCESS_ABORT_THRESHOLDS does not compile"))
+        << result.out;
+}
+
+// A check leaves the data directory of the running monitor as it found it.
+TEST_F(CheckConfig, AnExplicitFileCreatesNoDataDirectory) {
+    std::string candidate = write("candidate.trm", example_text());
+    std::string absent = dir + "/data";
+    platform_test::set_variable("TELV_DATA_DIR", absent);
+    ChildResult result = check({candidate});
+    EXPECT_EQ(result.exit_status, 0) << result.out;
+    EXPECT_FALSE(platform_test::exists(absent));
+}
+
+TEST_F(CheckConfig, TheMonitorsTraceIsLeftAlone) {
+    std::string data = dir + "/data";
+    std::filesystem::create_directory(data);
+    platform_test::set_variable("TELV_DATA_DIR", data);
+    std::string trace = "2021-03-05T07:04:09Z 4711 4711 TARNMNDF: a line of the running monitor\n";
+    std::ofstream(data + "/telvzmnd.trace", std::ios::binary) << trace;
+    std::ofstream(data + "/telvzopt.trm", std::ios::binary) << example_text();
+
+    EXPECT_EQ(check({write("candidate.trm", example_text())}).exit_status, 0);
+    EXPECT_EQ(check({}).exit_status, 0); // the monitor's own control file, read its way
+    EXPECT_EQ(platform_test::read_file(data + "/telvzmnd.trace"), trace);
+    std::vector<std::string> names;
+    for (const auto &entry : std::filesystem::directory_iterator(data)) {
+        names.push_back(entry.path().filename());
+    }
+    std::sort(names.begin(), names.end());
+    EXPECT_EQ(names, (std::vector<std::string>{"telvzmnd.trace", "telvzopt.trm"}));
 }
 
 } // namespace

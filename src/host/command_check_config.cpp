@@ -6,6 +6,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "commands.h"
@@ -13,11 +14,13 @@
 #include "core/settings.h"
 #include "core/validation.h"
 #include "filesvc.h"
+#include "snapshot_reader.h"
 
 namespace {
 
-// Where the default platform writes its events.
+// Where the default platform writes its events and its trace.
 constexpr const char *EVENT_LOG_VARIABLE = "TELV_EVENT_LOG";
+constexpr const char *TRACE_FILE_VARIABLE = "TELV_TRACE_FILE";
 
 // The default platform's data directory, named in messages only: the file itself is reached
 // through the platform's data-file service, as the monitor reaches it.
@@ -29,15 +32,15 @@ std::string data_directory_for_people() {
 struct control_text {
     std::vector<char> bytes = std::vector<char>(CONTROL_FILE_MAX, '\0');
     uint32_t length = 0;
-    std::string where; // for messages
+    std::string where; // for messages, shown as terminal_text shows it
     int error = 0;     // errno of a failed open or read
     bool opened = false;
 };
 
 // The monitor's way: the data-file service, the whole file in one read of at most 100,000 bytes.
 void read_through_data_files(control_text &text) {
-    text.where =
-        std::string(CONTROL_FILE_NAME) + " in the data directory " + data_directory_for_people();
+    text.where = terminal_text(std::string(CONTROL_FILE_NAME) + " in the data directory " +
+                               data_directory_for_people());
     filesvc_handle_t handle = 0;
     uint32_t info = 0;
     uint32_t crc = 0;
@@ -55,7 +58,7 @@ void read_through_data_files(control_text &text) {
 }
 
 void read_from_path(control_text &text, const char *path) {
-    text.where = path;
+    text.where = terminal_text(path);
     FILE *file = std::fopen(path, "rb");
     if (file == nullptr) {
         text.error = errno;
@@ -69,21 +72,29 @@ void read_from_path(control_text &text, const char *path) {
     std::fclose(file);
 }
 
-// Why the file cannot be read, or null when it can; the monitor's own limit of 2 bytes included.
-const char *read_problem(const control_text &text) {
+// Why the file cannot be read, or empty when it can; the monitor's own limit of 2 bytes included.
+std::string read_problem(const control_text &text) {
+    std::string reason = text.error != 0 ? std::string(" (") + std::strerror(text.error) + ")" : "";
     if (!text.opened && text.error == ENOENT) {
         return "does not exist; without it the monitor does not run (and reports nothing)";
     }
     if (!text.opened) {
-        return "cannot be opened; without it the monitor does not run (and reports nothing)";
+        return "cannot be opened" + reason +
+               "; without it the monitor does not run (and reports nothing)";
     }
     if (text.error != 0) {
-        return "cannot be read; the monitor reports 0xE081 and does not run";
+        return "cannot be read" + reason + "; the monitor reports 0xE081 and does not run";
     }
     if (text.length < CONTROL_FILE_MIN) {
         return "holds fewer than 2 bytes; the monitor reports 0xE081 and does not run";
     }
-    return nullptr;
+    return "";
+}
+
+// A name or an expression from the file, up to its NUL, as the terminal may be shown it.
+template <size_t N>
+std::string shown(const char (&field)[N]) {
+    return terminal_text(std::string_view(field, strnlen(field, N)));
 }
 
 void print_settings() {
@@ -105,7 +116,7 @@ void print_tables(const control_file_tables &tables) {
     std::printf("\nExternal checking routines: %d\n", tables.call_count);
     for (int32_t i = 0; tables.calls != nullptr && i < tables.call_count; ++i) {
         const external_call &call = tables.calls[i];
-        std::printf("  %d: %s  %s\n", i, call.name,
+        std::printf("  %d: %s  %s\n", i, shown(call.name).c_str(),
                     call.address != nullptr ? "resolved" : "NOT resolved");
     }
     std::printf("\nProcess log thresholds: %d\n", tables.log_count);
@@ -117,8 +128,8 @@ void print_tables(const control_file_tables &tables) {
         }
         std::printf("  %d: processes matching [%s]  rss %d KB  dsiz %d KB  vsize %d KB  "
                     "memoryCheckFlag %d\n",
-                    i, row.process_mask, row.rss_limit, row.dsiz_limit, row.vsize_limit,
-                    row.memoryCheckFlag);
+                    i, shown(row.process_mask).c_str(), row.rss_limit, row.dsiz_limit,
+                    row.vsize_limit, row.memoryCheckFlag);
     }
     std::printf("\nProcess abort thresholds: %d\n", tables.abort_count);
     for (int32_t i = 0; tables.abort_rows != nullptr && i < tables.abort_count; ++i) {
@@ -128,7 +139,7 @@ void print_tables(const control_file_tables &tables) {
             continue;
         }
         std::printf("  %d: processes matching [%s]  rss %d KB  dsiz %d KB  vsize %d KB\n", i,
-                    row.process_mask, row.rss_abort_limit, row.dsiz_abort_limit,
+                    shown(row.process_mask).c_str(), row.rss_abort_limit, row.dsiz_abort_limit,
                     row.vsize_abort_limit);
     }
 }
@@ -142,12 +153,14 @@ int print_table_problems(const control_file_tables &tables) {
         if (problem.kind == control_file_problem_kind::uncompiled_expression) {
             std::printf("PROBLEM: line %d: the process name expression [%s] of %s does not "
                         "compile (%s); the monitor drops this row without a message\n",
-                        problem.line, problem.first, problem.keyword, problem.second);
+                        problem.line, shown(problem.first).c_str(), shown(problem.keyword).c_str(),
+                        shown(problem.second).c_str());
         } else {
             std::printf("PROBLEM: line %d: the routine %s of module %s cannot be resolved "
                         "(module service result %u, crc %u); the monitor reports 0xE086 and "
                         "does not run\n",
-                        problem.line, problem.second, problem.first, problem.rc, problem.crc);
+                        problem.line, shown(problem.second).c_str(), shown(problem.first).c_str(),
+                        problem.rc, problem.crc);
         }
     }
     if (tables.problem_count > kept) {
@@ -171,28 +184,25 @@ void print_rule_failure(const setting &entry) {
 
 } // namespace
 
-int command_check_config(command_args args) {
-    if (args.size() > 1) {
-        std::fprintf(stderr, "usage: tarnmon check-config [FILE]\n");
-        return EXIT_USAGE;
-    }
+int command_check_config(const command_line &line) {
+    // A check raises no events and writes no trace: what the parser reports while checking (an
+    // unresolved routine, a failed allocation) is told here in words, and the appliance's event
+    // log and trace keep only what a running monitor did. Set before anything can trace.
+    setenv(EVENT_LOG_VARIABLE, "/dev/null", 1);
+    setenv(TRACE_FILE_VARIABLE, "/dev/null", 1);
     control_text text;
-    if (args.empty()) {
+    if (line.operands.empty()) {
         read_through_data_files(text);
     } else {
-        read_from_path(text, args[0]);
+        read_from_path(text, line.operands[0]);
     }
-    if (const char *problem = read_problem(text)) {
-        std::printf("PROBLEM: the control file %s %s\n", text.where.c_str(), problem);
+    if (std::string problem = read_problem(text); !problem.empty()) {
+        std::printf("PROBLEM: the control file %s %s\n", text.where.c_str(), problem.c_str());
         return text.opened ? EXIT_FINDING : EXIT_UNAVAILABLE;
     }
     text.bytes[CONTROL_FILE_MAX - 1] = '\0';
     std::printf("Control file: %s (%u bytes read)\n\n", text.where.c_str(), text.length);
 
-    // A check raises no events: what the parser reports while checking (an unresolved routine,
-    // a failed allocation) is told here in words, and the appliance's event log keeps only what a
-    // running monitor raised.
-    setenv(EVENT_LOG_VARIABLE, "/dev/null", 1);
     // As monitoring starts without a checking interval from its host.
     settings_start_values();
     uint32_t crc = 0;

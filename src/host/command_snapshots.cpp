@@ -1,28 +1,28 @@
 // tarnmon snapshots: lists the blocks of the snapshot file, or shows one of them.
 #include <cerrno>
 #include <charconv>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <fstream>
-#include <sstream>
+#include <fcntl.h>
+#include <new>
 #include <string>
 #include <string_view>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "capture/snapshot_file.h"
 #include "commands.h"
+#include "data_blocks.h"
 #include "linux/environment.h"
 #include "snapshot_reader.h"
 
 namespace {
 
-constexpr const char *USAGE = "usage: tarnmon snapshots [--file PATH] [N|last]\n";
-
-struct request {
-    std::string path;
-    std::string_view which; // empty = list, "last", or a block number
-    bool valid = true;
-};
+// The most a snapshot file can hold: the largest size its control file can give it, and the one
+// flush of the staging buffer that may carry it past that size before it wraps.
+constexpr uint64_t SNAPSHOT_FILE_BOUND = uint64_t{UINT32_MAX} + FILE_BUFFER_SIZE;
 
 // The file the monitor writes: "telvzmnd.trm" in the default platform's data directory.
 std::string default_path() {
@@ -33,40 +33,61 @@ std::string default_path() {
     return base + "/" + SNAPSHOT_FILE_NAME;
 }
 
-request parse(command_args args) {
-    request r;
-    r.path = default_path();
-    for (size_t i = 0; i < args.size(); ++i) {
-        std::string_view word = args[i];
-        if (word == "--file" && i + 1 < args.size()) {
-            r.path = args[++i];
-        } else if (r.which.empty() && !word.starts_with("-")) {
-            r.which = word;
-        } else {
-            r.valid = false;
-        }
-    }
-    return r;
+std::string cannot(const char *what, const std::string &path, int error) {
+    return std::string("cannot ") + what + " " + path + ": " + std::strerror(error);
 }
 
-// The whole file; false with `problem` set when it cannot be read.
+struct descriptor {
+    explicit descriptor(int opened) : fd(opened) {}
+    descriptor(const descriptor &) = delete;
+    descriptor &operator=(const descriptor &) = delete;
+    ~descriptor() {
+        if (fd >= 0) {
+            ::close(fd);
+        }
+    }
+    const int fd;
+};
+
+// The whole file; false with `problem` set when it cannot be read. Only a regular file within the
+// bound is read: a device or a pipe has no end, and a directory no text.
 bool read_file(const std::string &path, std::string *text, std::string *problem) {
-    std::ifstream in(path, std::ios::binary);
-    if (!in) {
+    // Non-blocking, so that the open of a pipe returns for fstat to refuse it.
+    descriptor file{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK)};
+    int fd = file.fd;
+    if (fd < 0) {
         *problem = errno == ENOENT
                        ? "no snapshot file at " + path + ": the monitor has not written one (or " +
                              telv::environment::DATA_DIR_VARIABLE + " names another directory)"
-                       : "cannot open " + path + ": " + std::strerror(errno);
+                       : cannot("open", path, errno);
         return false;
     }
-    std::ostringstream content;
-    content << in.rdbuf();
-    if (in.bad()) {
-        *problem = "cannot read " + path;
-        return false;
+    struct stat st;
+    if (::fstat(fd, &st) != 0) {
+        *problem = cannot("read", path, errno);
+    } else if (!S_ISREG(st.st_mode)) {
+        *problem = "cannot read " + path + ": not a regular file";
+    } else if (static_cast<uint64_t>(st.st_size) > SNAPSHOT_FILE_BOUND) {
+        *problem = "cannot read " + path + ": it holds " + std::to_string(st.st_size) +
+                   " bytes, more than a snapshot file can hold (" +
+                   std::to_string(SNAPSHOT_FILE_BOUND) + ")";
+    } else {
+        // The size fstat saw: text the monitor appends meanwhile is left out, and the read stays
+        // within the bound.
+        text->resize(static_cast<size_t>(st.st_size));
+        size_t got = 0;
+        for (ssize_t n = 1; n != 0 && got < text->size();) {
+            n = ::read(fd, text->data() + got, text->size() - got);
+            if (n > 0) {
+                got += static_cast<size_t>(n);
+            } else if (n < 0 && errno != EINTR) {
+                *problem = cannot("read", path, errno);
+                break;
+            }
+        }
+        text->resize(got);
     }
-    *text = content.str();
-    return true;
+    return problem->empty();
 }
 
 void list(const std::string &path, size_t size, const std::vector<snapshot_block> &blocks) {
@@ -111,26 +132,20 @@ bool is_selector(std::string_view which) {
     return which == "last" || which.find_first_not_of("0123456789") == std::string_view::npos;
 }
 
-} // namespace
-
-int command_snapshots(command_args args) {
-    request r = parse(args);
-    if (!r.valid || !is_selector(r.which)) {
-        std::fputs(USAGE, stderr);
-        return EXIT_USAGE;
-    }
+// Shows what `which` asks for: the list when it is empty, a block otherwise.
+int show(const std::string &path, std::string_view which) {
     std::string text;
     std::string problem;
-    if (!read_file(r.path, &text, &problem)) {
+    if (!read_file(path, &text, &problem)) {
         std::fprintf(stderr, "tarnmon: %s\n", problem.c_str());
         return EXIT_UNAVAILABLE;
     }
     std::vector<snapshot_block> blocks = read_snapshots(text);
-    if (r.which.empty()) {
-        list(r.path, text.size(), blocks);
+    if (which.empty()) {
+        list(path, text.size(), blocks);
         return EXIT_OK;
     }
-    size_t index = select(r.which, blocks, &problem);
+    size_t index = select(which, blocks, &problem);
     if (index == blocks.size()) {
         std::fprintf(stderr, "tarnmon: %s\n", problem.c_str());
         return EXIT_UNAVAILABLE;
@@ -138,4 +153,21 @@ int command_snapshots(command_args args) {
     std::string shown = terminal_text(blocks[index].text);
     std::fwrite(shown.data(), 1, shown.size(), stdout);
     return EXIT_OK;
+}
+
+} // namespace
+
+int command_snapshots(const command_line &line) {
+    std::string_view which = line.operands.empty() ? "" : line.operands[0];
+    if (!is_selector(which)) {
+        return EXIT_USAGE;
+    }
+    std::string path = line.file != nullptr ? line.file : default_path();
+    // A file within the bound may still hold more than this host can hold in memory.
+    try {
+        return show(path, which);
+    } catch (const std::bad_alloc &) {
+        std::fprintf(stderr, "tarnmon: %s\n", cannot("read", path, ENOMEM).c_str());
+        return EXIT_UNAVAILABLE;
+    }
 }

@@ -39,14 +39,10 @@ constexpr field FIELDS[] = {
 
 } // namespace
 
-int command_status(command_args args) {
-    if (!args.empty()) {
-        std::fprintf(stderr, "usage: tarnmon status\n");
-        return EXIT_USAGE;
-    }
+int command_status(const command_line &) {
     control_block_view view = attach_control_block();
     if (view.block == nullptr) {
-        std::printf("tarnmon: %s\n", view.problem.c_str());
+        std::fprintf(stderr, "tarnmon: %s\n", view.problem.c_str());
         return EXIT_UNAVAILABLE;
     }
     std::printf("control block 0x%08x: id %d, %u bytes, attached by %llu process(es)\n",

@@ -31,7 +31,7 @@ control_block_view attach_control_block() {
     }
     if (info.shm_segsz != TARN_CB_SIZE) {
         std::snprintf(text, sizeof text,
-                      "the segment of key 0x%08x has %zu bytes, not the %u of a control block",
+                      "the segment of key 0x%08x is not a control block: it has %zu bytes, not %u",
                       TARN_CB_KEY, static_cast<size_t>(info.shm_segsz), TARN_CB_SIZE);
         view.problem = text;
         return view;
