@@ -43,13 +43,17 @@ std::string read_file(const std::string &path) {
     return text.str();
 }
 
-std::vector<std::string> read_lines(const std::string &path) {
+std::vector<std::string> lines_of(const std::string &text) {
     std::vector<std::string> lines;
-    std::istringstream text(read_file(path));
-    for (std::string line; std::getline(text, line);) {
+    std::istringstream in(text);
+    for (std::string line; std::getline(in, line);) {
         lines.push_back(line);
     }
     return lines;
+}
+
+std::vector<std::string> read_lines(const std::string &path) {
+    return lines_of(read_file(path));
 }
 
 bool exists(const std::string &path) {

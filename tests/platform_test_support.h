@@ -31,7 +31,8 @@ void set_variable(const char *name, const std::string &value);
 
 // Whole contents; empty when missing.
 std::string read_file(const std::string &path);
-// Lines without their line feed.
+// Lines without their line feed: of a text, and of a file.
+std::vector<std::string> lines_of(const std::string &text);
 std::vector<std::string> read_lines(const std::string &path);
 bool exists(const std::string &path);
 long file_size(const std::string &path); // -1 when missing

@@ -1,13 +1,19 @@
 // The trace service of the default platform: stamped lines in a size-bounded trace file.
+#include <algorithm>
 #include <atomic>
 #include <cctype>
 #include <cerrno>
 #include <cstdio>
+#include <fcntl.h>
+#include <map>
+#include <numeric>
 #include <string>
 #include <string_view>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
+#include <utility>
 #include <vector>
 
 #include "platform_test_support.h"
@@ -62,15 +68,134 @@ bool parse(const std::string &line, TraceLine *out) {
     return true;
 }
 
-// The texts of the trace file, every line checked for its stamp.
-std::vector<std::string> texts(const std::string &path) {
+// The texts of trace lines, every line checked for its stamp.
+std::vector<std::string> texts_of(const std::string &contents) {
     std::vector<std::string> found;
-    for (const std::string &line : read_lines(path)) {
+    for (const std::string &line : platform_test::lines_of(contents)) {
         TraceLine parsed;
         EXPECT_TRUE(parse(line, &parsed)) << line;
         found.push_back(parsed.text);
     }
     return found;
+}
+
+std::vector<std::string> texts(const std::string &path) {
+    return texts_of(read_file(path));
+}
+
+// The type bits of what `path` itself is (a link is not followed); 0 when nothing has that name.
+mode_t file_type(const std::string &path) {
+    struct stat st;
+    return ::lstat(path.c_str(), &st) == 0 ? st.st_mode & S_IFMT : 0;
+}
+
+// Processes writing to one trace file: the parent writes line 0 of process 0, so that the file is
+// open when the children are made, as in a host that spawns; then each child (processes 1 to
+// `processes`) writes `lines` lines from each of its `threads` threads.
+struct Writers {
+    int processes;
+    int threads;
+    int lines;
+};
+
+// The text of a writer's line, "TARNPRCF: process P thread T line I", padded with dots to a fixed
+// width so that lines differ in length only by the digits of their stamps.
+constexpr size_t WRITER_TEXT = 80;
+
+std::string writer_text(int process, int thread, int line) {
+    char text[WRITER_TEXT + 1];
+    int length = std::snprintf(text, sizeof text, "TARNPRCF: process %d thread %d line %d ",
+                               process, thread, line);
+    std::string padded(text, static_cast<size_t>(std::max(length, 0)));
+    padded.resize(WRITER_TEXT, '.');
+    return padded;
+}
+
+// Runs the writers and waits for them. Each child sends the number of its calls that returned -1
+// through a pipe: the sum of them, or -1 when a child did not end normally or sent nothing.
+long run_writers(const Writers &writers) {
+    EXPECT_GT(tracesvc_trace("%s", writer_text(0, 0, 0).c_str()), 0);
+    int report[2];
+    if (::pipe(report) != 0) {
+        return -1;
+    }
+    std::vector<pid_t> children;
+    for (int process = 1; process <= writers.processes; ++process) {
+        pid_t child = ::fork();
+        if (child == 0) {
+            ::close(report[0]);
+            std::atomic<int> failures = 0;
+            std::vector<std::thread> threads;
+            for (int thread = 0; thread < writers.threads; ++thread) {
+                threads.emplace_back([&, thread] {
+                    for (int i = 0; i < writers.lines; ++i) {
+                        if (tracesvc_trace("%s", writer_text(process, thread, i).c_str()) < 0) {
+                            ++failures;
+                        }
+                    }
+                });
+            }
+            for (auto &thread : threads) {
+                thread.join();
+            }
+            int count = failures;
+            ::_exit(::write(report[1], &count, sizeof count) == sizeof count ? 0 : 1);
+        }
+        if (child > 0) {
+            children.push_back(child);
+        }
+    }
+    ::close(report[1]);
+    bool all_ended_well = children.size() == static_cast<size_t>(writers.processes);
+    for (pid_t child : children) {
+        int status = 0;
+        all_ended_well &=
+            ::waitpid(child, &status, 0) == child && WIFEXITED(status) && WEXITSTATUS(status) == 0;
+    }
+    long failures = 0;
+    int reports = 0;
+    for (int count = 0; ::read(report[0], &count, sizeof count) == sizeof count; ++reports) {
+        failures += count;
+    }
+    ::close(report[0]);
+    return all_ended_well && reports == writers.processes ? failures : -1;
+}
+
+// Of each process and thread, the numbers of its lines in the order found in "<path>.1" then
+// "<path>". Every line must be a whole writer's line, and each file within `bound`.
+using LineNumbers = std::map<std::pair<int, int>, std::vector<int>>;
+
+LineNumbers writer_lines(const std::string &path, long bound) {
+    LineNumbers found;
+    for (const std::string &file : {path + ".1", path}) {
+        EXPECT_LE(file_size(file), bound) << file;
+        for (const std::string &text : texts(file)) {
+            int process = -1;
+            int thread = -1;
+            int i = -1;
+            bool whole = std::sscanf(text.c_str(), "TARNPRCF: process %d thread %d line %d",
+                                     &process, &thread, &i) == 3 &&
+                         text == writer_text(process, thread, i);
+            EXPECT_TRUE(whole) << text;
+            if (whole) {
+                found[{process, thread}].push_back(i);
+            }
+        }
+    }
+    return found;
+}
+
+// Every line the writers write, once and in order.
+LineNumbers all_lines(const Writers &writers) {
+    LineNumbers all{{{0, 0}, {0}}};
+    for (int process = 1; process <= writers.processes; ++process) {
+        for (int thread = 0; thread < writers.threads; ++thread) {
+            std::vector<int> &numbers = all[{process, thread}];
+            numbers.resize(static_cast<size_t>(writers.lines));
+            std::iota(numbers.begin(), numbers.end(), 0);
+        }
+    }
+    return all;
 }
 
 using PlatformTrace = platform_test::PlatformTest;
@@ -167,6 +292,12 @@ TEST_F(PlatformTrace, TheFileStaysWithinItsBoundAndRotates) {
     ASSERT_FALSE(current.empty());
     ASSERT_FALSE(previous.empty());
     EXPECT_EQ(current.back(), "TARNROTF: line 099 of the rotation test");
+    // A regular file named directly is rotated, never noted as past its bound.
+    for (const std::vector<std::string> *lines : {&previous, &current}) {
+        for (const std::string &text : *lines) {
+            EXPECT_EQ(text.rfind("TARNROTF: line ", 0), 0u) << text;
+        }
+    }
     // The renamed file ends with the line just before the first of the new file.
     int last_old = std::stoi(previous.back().substr(15, 3));
     int first_new = std::stoi(current.front().substr(15, 3));
@@ -276,33 +407,103 @@ TEST_F(PlatformTrace, LinesOfManyThreadsNeverInterleave) {
 
 TEST_F(PlatformTrace, ProcessesSharingTheFileKeepWholeLinesAndTheBound) {
     set_variable("TELV_TRACE_MAX_BYTES", "4000");
-    constexpr int LINES = 300;
-    // The trace file is already open when the child is made, as in a host that spawns.
-    tracesvc_trace("TARNPRCF: parent line %d", LINES);
-    pid_t child = ::fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        for (int i = 0; i < LINES; ++i) {
-            tracesvc_trace("TARNPRCF: child line %d", i);
-        }
-        ::_exit(0);
+    EXPECT_EQ(run_writers({2, 1, 300}), 0);
+    writer_lines(trace_path(), 4000);
+}
+
+TEST_F(PlatformTrace, ProcessesRotatingUnderEachOtherLoseNoLine) {
+    // Every line fills a file of its own, so nearly every line finds its file rotated away by
+    // another process at least once before it is written.
+    set_variable("TELV_TRACE_MAX_BYTES", "200");
+    EXPECT_EQ(run_writers({4, 4, 100}), 0);
+    writer_lines(trace_path(), 200);
+}
+
+TEST_F(PlatformTrace, ProcessesSharingOneRotationKeepEveryLineOnce) {
+    const Writers writers{4, 4, 50};
+    // A line: the time (24 characters), the pid and the thread (1 to 10 digits each), three
+    // blanks, the text, the line feed.
+    constexpr long SHORTEST = 24 + 1 + 1 + 3 + static_cast<long>(WRITER_TEXT) + 1;
+    constexpr long LONGEST = 24 + 10 + 10 + 3 + static_cast<long>(WRITER_TEXT) + 1;
+    const long count = 1 + static_cast<long>(writers.processes) * writers.threads * writers.lines;
+    // More than the bound in all, so the file is rotated once; less than twice the bound less a
+    // line, so the new file never fills and "<file>.1" is never replaced: no line may be missing.
+    const long bound = count * SHORTEST - 1;
+    ASSERT_LE(count * LONGEST, 2 * bound - LONGEST + 1);
+    set_variable("TELV_TRACE_MAX_BYTES", std::to_string(bound));
+    EXPECT_EQ(run_writers(writers), 0);
+    EXPECT_GT(file_size(trace_path() + ".1"), 0);
+    EXPECT_EQ(writer_lines(trace_path(), bound), all_lines(writers));
+}
+
+TEST_F(PlatformTrace, ALinkIsWrittenThroughAndNeverRotated) {
+    std::string target = dir + "/target.trace";
+    std::string link = dir + "/link.trace";
+    ASSERT_EQ(::symlink(target.c_str(), link.c_str()), 0);
+    set_variable("TELV_TRACE_FILE", link);
+    set_variable("TELV_TRACE_MAX_BYTES", "300");
+    std::vector<std::string> expected;
+    for (int i = 0; i < 20; ++i) {
+        expected.push_back("TARNLNKF: line " + std::to_string(i) + " through the link");
+        EXPECT_GT(tracesvc_trace("%s", expected.back().c_str()), 0);
     }
-    for (int i = 0; i < LINES; ++i) {
-        tracesvc_trace("TARNPRCF: parent line %d", i);
+    EXPECT_EQ(file_type(link), S_IFLNK);
+    EXPECT_EQ(file_type(link + ".1"), 0u);
+    EXPECT_EQ(file_type(target + ".1"), 0u);
+    EXPECT_GT(file_size(target), 300);
+    std::vector<std::string> found = texts(target);
+    std::string note = "TELVTRCF: trace file " + link +
+                       " is not a regular file: it is not rotated and grows past its bound of "
+                       "300 bytes";
+    EXPECT_EQ(std::count(found.begin(), found.end(), note), 1);
+    found.erase(std::remove(found.begin(), found.end(), note), found.end());
+    EXPECT_EQ(found, expected);
+}
+
+TEST_F(PlatformTrace, ADeviceIsWrittenAndNeverRotated) {
+    set_variable("TELV_TRACE_FILE", "/dev/null");
+    set_variable("TELV_TRACE_MAX_BYTES", "50");
+    for (int i = 0; i < 20; ++i) {
+        EXPECT_GT(tracesvc_trace("TARNDEVF: line %d to the null device", i), 0);
     }
-    int status = 0;
-    ASSERT_EQ(::waitpid(child, &status, 0), child);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-    for (const std::string &path : {trace_path(), trace_path() + ".1"}) {
-        EXPECT_LE(file_size(path), 4000);
-        for (const std::string &text : texts(path)) {
-            char who[16] = {};
-            int i = -1;
-            ASSERT_EQ(std::sscanf(text.c_str(), "TARNPRCF: %15s line %d", who, &i), 2) << text;
-            EXPECT_EQ(text, "TARNPRCF: " + std::string(who) + " line " + std::to_string(i));
-            EXPECT_TRUE(std::string(who) == "child" || std::string(who) == "parent") << text;
-        }
+    EXPECT_EQ(file_type("/dev/null"), S_IFCHR);
+    EXPECT_EQ(file_type("/dev/null.1"), 0u);
+}
+
+TEST_F(PlatformTrace, AFifoIsWrittenAndNeverRotated) {
+    std::string fifo = dir + "/trace.fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+    ASSERT_GE(reader, 0);
+    set_variable("TELV_TRACE_FILE", fifo);
+    set_variable("TELV_TRACE_MAX_BYTES", "100");
+    std::vector<std::string> expected;
+    for (int i = 0; i < 10; ++i) {
+        expected.push_back("TARNFIFF: line " + std::to_string(i));
+        EXPECT_GT(tracesvc_trace("%s", expected.back().c_str()), 0);
     }
+    // The platform lets go of the FIFO before its reader does, so no later line meets a pipe
+    // without a reader.
+    set_variable("TELV_TRACE_FILE", trace_path());
+    tracesvc_trace("TARNFIFF: back to the trace file");
+    std::string contents;
+    char chunk[4096];
+    for (ssize_t n; (n = ::read(reader, chunk, sizeof chunk)) > 0;) {
+        contents.append(chunk, static_cast<size_t>(n));
+    }
+    ::close(reader);
+    EXPECT_EQ(texts_of(contents), expected);
+    EXPECT_EQ(file_type(fifo), S_IFIFO);
+    EXPECT_EQ(file_type(fifo + ".1"), 0u);
+}
+
+TEST_F(PlatformTrace, ARotationThatMovesNothingFailsInsteadOfGoingRound) {
+    set_variable("TELV_TRACE_MAX_BYTES", "100");
+    ASSERT_GT(tracesvc_trace("TARNHLKF: first"), 0);
+    // "<name>.1" is the file itself: renaming one name over the other leaves both in place.
+    ASSERT_EQ(::link(trace_path().c_str(), (trace_path() + ".1").c_str()), 0);
+    EXPECT_EQ(tracesvc_trace("TARNHLKF: the second line, which takes the file past its bound"), -1);
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNHLKF: first"});
 }
 
 } // namespace

@@ -6,6 +6,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <mutex>
+#include <set>
 #include <string>
 #include <sys/file.h>
 #include <sys/stat.h>
@@ -25,8 +26,9 @@ struct Sink {
     std::string path;
     int fd = -1;
     pid_t owner = 0; // a forked child opens its own: flock is shared with the opener's description
-    dev_t device = 0;
-    ino_t inode = 0;
+    // Paths already said in the trace to be past their bound and not rotated: once a process is
+    // enough (a forked child inherits what its parent has said).
+    std::set<std::string> said_unrotated;
 };
 
 // Never destroyed: the leak report written while the process exits still traces.
@@ -42,25 +44,74 @@ void close_sink(Sink &s) {
     s.fd = -1;
 }
 
-bool open_sink(Sink &s, const std::string &path) {
-    close_sink(s);
-    s.path = path;
-    s.fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
-    s.owner = ::getpid();
-    struct stat st;
-    if (s.fd >= 0 && ::fstat(s.fd, &st) == 0) {
-        s.device = st.st_dev;
-        s.inode = st.st_ino;
-        return true;
-    }
-    close_sink(s);
-    return false;
+bool same_file(const struct stat &a, const struct stat &b) {
+    return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
-// Another process may have renamed the file since it was opened here.
-bool still_named(const Sink &s) {
-    struct stat st;
-    return ::stat(s.path.c_str(), &st) == 0 && st.st_dev == s.device && st.st_ino == s.inode;
+// Opens `path` for appending in place of the sink's file. The former file stays open until the new
+// one is, so that no new file can take over its inode number and the two can be told apart: when
+// `must_change` (the former was just renamed away), a path that opens the former file again is
+// refused, since then nothing has moved on and another round would find the same again.
+bool open_sink(Sink &s, const std::string &path, bool must_change) {
+    int fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
+    struct stat opened;
+    struct stat former;
+    bool same = fd >= 0 && must_change && s.fd >= 0 && ::fstat(fd, &opened) == 0 &&
+                ::fstat(s.fd, &former) == 0 && same_file(opened, former);
+    close_sink(s);
+    s.path = path;
+    s.owner = ::getpid();
+    if (fd >= 0 && same) {
+        ::close(fd);
+        fd = -1;
+    }
+    s.fd = fd;
+    return fd >= 0;
+}
+
+// flock for the scope of a round; a signal while waiting is no reason to give up.
+class FileLock {
+  public:
+    explicit FileLock(int fd) : fd_(fd) {
+        int result;
+        while ((result = ::flock(fd_, LOCK_EX)) != 0 && errno == EINTR) {
+        }
+        held_ = result == 0;
+    }
+    ~FileLock() {
+        if (held_) {
+            ::flock(fd_, LOCK_UN);
+        }
+    }
+    FileLock(const FileLock &) = delete;
+    FileLock &operator=(const FileLock &) = delete;
+    bool held() const { return held_; }
+
+  private:
+    int fd_;
+    bool held_;
+};
+
+// How the path leads to the open file, looked at under the file's lock.
+enum class Reach {
+    directly,  // the path is the regular file's own name: the file is rotated when full
+    unrotated, // the path leads to the file some other way, through a symbolic link (renaming
+               // would move the link, not the trace) or as a device or FIFO: never rotated
+    elsewhere, // the path names another file now: this one was renamed away, or removed
+};
+
+Reach reach(const std::string &path, const struct stat &open_file) {
+    // Only a regular file is ever rotated, so only one can have been renamed away. A device node
+    // may open another device than itself (/dev/tty opens the terminal), so it is not compared.
+    if (!S_ISREG(open_file.st_mode)) {
+        return Reach::unrotated;
+    }
+    struct stat named;
+    if (::lstat(path.c_str(), &named) == 0 && S_ISREG(named.st_mode)) {
+        return same_file(named, open_file) ? Reach::directly : Reach::elsewhere;
+    }
+    return ::stat(path.c_str(), &named) == 0 && same_file(named, open_file) ? Reach::unrotated
+                                                                            : Reach::elsewhere;
 }
 
 struct Target {
@@ -75,37 +126,57 @@ Target current_target() {
                   environment::text(DETAIL_VARIABLE, "1") != "0"};
 }
 
-// Appends one composed line, first moving a file that it would take past the bound to
-// "<name>.1". A few rounds are allowed because another process may rotate in between.
-bool append(Sink &s, const Target &target, const char *line, size_t length) {
-    constexpr int ROUNDS = 4;
-    bool written = false;
-    bool failed = false;
-    for (int round = 0; round < ROUNDS && !written && !failed; ++round) {
-        bool reopen = s.fd < 0 || s.path != target.path || s.owner != ::getpid();
-        if (reopen && !open_sink(s, target.path)) {
-            failed = true;
-            continue;
-        }
-        ::flock(s.fd, LOCK_EX);
-        struct stat st;
-        if (!still_named(s) || ::fstat(s.fd, &st) != 0) {
-            ::flock(s.fd, LOCK_UN);
-            close_sink(s);
-            continue;
-        }
-        auto size = static_cast<uint64_t>(st.st_size);
-        if (size > 0 && size + length > target.max_bytes) {
-            failed = ::rename(s.path.c_str(), (s.path + ".1").c_str()) != 0;
-            ::flock(s.fd, LOCK_UN);
-            close_sink(s);
-            continue;
-        }
-        written = io::write_all(s.fd, line, length) == 0;
-        failed = !written;
-        ::flock(s.fd, LOCK_UN);
+// What became of a line in one round under the file's lock.
+enum class Round {
+    written,
+    written_past_bound, // into a full file that is not rotated
+    rotated,            // not yet written: the file was renamed (here or elsewhere) or removed
+    failed,
+};
+
+Round append_once(const Sink &s, const Target &target, const char *line, size_t length) {
+    FileLock locked(s.fd);
+    struct stat open_file;
+    if (!locked.held() || ::fstat(s.fd, &open_file) != 0) {
+        return Round::failed;
     }
-    return written;
+    Reach how = reach(s.path, open_file);
+    if (how == Reach::elsewhere) {
+        return Round::rotated;
+    }
+    auto size = static_cast<uint64_t>(open_file.st_size);
+    bool full = size > 0 && size + length > target.max_bytes;
+    if (full && how == Reach::directly) {
+        return ::rename(s.path.c_str(), (s.path + ".1").c_str()) == 0 ? Round::rotated
+                                                                      : Round::failed;
+    }
+    if (io::write_all(s.fd, line, length) != 0) {
+        return Round::failed;
+    }
+    return full ? Round::written_past_bound : Round::written;
+}
+
+// Appends one composed line, first moving a file that it would take past the bound to
+// "<name>.1". Another process rotating the file under us loses no line: the path is opened again
+// and the line goes to the new file. Each such round follows a rename, here or elsewhere, so the
+// loop moves on; a rename that moves nothing (the path opens the same file again) fails, and so
+// does every failing open, lock or write.
+Round append(Sink &s, const Target &target, const char *line, size_t length) {
+    Round round = Round::rotated;
+    for (bool renamed = false; round == Round::rotated; renamed = true) {
+        bool stale = s.fd < 0 || s.path != target.path || s.owner != ::getpid();
+        if ((stale || renamed) && !open_sink(s, target.path, renamed)) {
+            return Round::failed;
+        }
+        round = append_once(s, target, line, length);
+    }
+    return round;
+}
+
+// What snprintf left in `buffer` (`size` bytes): the text as far as it fits, nothing on failure.
+std::string_view printed(const char *buffer, size_t size, int length) {
+    return std::string_view(buffer,
+                            length < 0 ? 0 : std::min(static_cast<size_t>(length), size - 1));
 }
 
 // Stamps, composes and appends one line; the caller holds the sink's lock.
@@ -115,12 +186,20 @@ bool emit(Sink &s, const Target &target, std::string_view text) {
                                      static_cast<long>(::getpid()), stamp::thread_id());
     char line[MAX_LINE];
     size_t room = static_cast<size_t>(std::min<uint64_t>(sizeof line, target.max_bytes));
-    size_t length =
-        compose(line, room,
-                std::string_view(stamp, std::clamp<size_t>(static_cast<size_t>(stamp_length), 0,
-                                                           sizeof stamp - 1)),
-                text);
-    return append(s, target, line, length);
+    size_t length = compose(line, room, printed(stamp, sizeof stamp, stamp_length), text);
+    Round round = append(s, target, line, length);
+    // A reader who finds the file past its bound learns why, once. The note is a line past the
+    // bound too, but by then the path has been said.
+    if (round == Round::written_past_bound && s.said_unrotated.insert(target.path).second) {
+        char note[MAX_LINE];
+        int note_length =
+            std::snprintf(note, sizeof note,
+                          "TELVTRCF: trace file %s is not a regular file: it is not rotated and "
+                          "grows past its bound of %llu bytes",
+                          target.path.c_str(), static_cast<unsigned long long>(target.max_bytes));
+        emit(s, target, printed(note, sizeof note, note_length));
+    }
+    return round == Round::written || round == Round::written_past_bound;
 }
 
 } // namespace

@@ -1,5 +1,6 @@
 // The trace file of the default platform: one line per trace call, stamped with the time, the pid
-// and the thread, kept within a size bound by renaming a full file to "<name>.1".
+// and the thread, kept within a size bound by renaming a full file to "<name>.1" when the path is
+// that regular file's own name (a link or a device is written to, never renamed).
 #pragma once
 
 #include <cstdarg>
