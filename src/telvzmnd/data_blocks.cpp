@@ -1,5 +1,8 @@
 #include "data_blocks.h"
 
+#include <algorithm>
+#include <cstring>
+
 char primaryDataBlock[PRIMARY_DATA_BLOCK_SIZE];
 int32_t outbufferleft = OUTBUFFER_BUDGET;
 int32_t pdboverflow;
@@ -11,3 +14,76 @@ char oldPSDataBlock[PS_DATA_BLOCK_SIZE];
 char line[LINE_SIZE];
 char words[WORD_COUNT][WORD_SIZE];
 char file_buffer[FILE_BUFFER_SIZE];
+
+namespace {
+
+constexpr char OVERFLOW_LINE[] = "No room to output more lines... \n\r";
+constexpr char LINE_END[] = "\n\r";
+
+size_t primary_length;     // strlen(primaryDataBlock), kept by every append
+size_t primary_high_water; // bytes written since the last clear, terminating NULs included
+size_t ps_high_water;      // bytes of newPSDataBlock written since its last clear
+
+void append_bytes(const char *text, size_t length) {
+    size_t room = PRIMARY_DATA_BLOCK_SIZE - 1 - primary_length;
+    size_t taken = length < room ? length : room;
+    std::memcpy(primaryDataBlock + primary_length, text, taken);
+    primary_length += taken;
+    primaryDataBlock[primary_length] = '\0';
+    primary_high_water = std::max(primary_high_water, primary_length + 1);
+}
+
+// outbufferleft moved by `change`, wrapping as the 32-bit counter always has.
+void move_budget(int64_t change) {
+    outbufferleft =
+        static_cast<int32_t>(static_cast<uint32_t>(static_cast<int64_t>(outbufferleft) + change));
+}
+
+} // namespace
+
+void append_data_line(const char *text) {
+    auto length = static_cast<int64_t>(std::strlen(text));
+    if (length + 5 >= outbufferleft) {
+        if (pdboverflow == 0) {
+            pdboverflow = 1;
+            append_bytes(OVERFLOW_LINE, sizeof OVERFLOW_LINE - 1);
+            outbufferleft = 4;
+        }
+        return;
+    }
+    append_bytes(text, static_cast<size_t>(length));
+    append_bytes(LINE_END, sizeof LINE_END - 1);
+    move_budget(-(length + 3));
+}
+
+void append_header_line(const char *text) {
+    size_t length = std::strlen(text);
+    append_bytes(text, length);
+    move_budget(static_cast<int64_t>(length));
+}
+
+void append_unbudgeted(const char *text) {
+    append_bytes(text, std::strlen(text));
+}
+
+size_t primary_data_length() {
+    return primary_length;
+}
+
+void clear_primary_data_block() {
+    std::memset(primaryDataBlock, 0, primary_high_water);
+    primary_length = 0;
+    primary_high_water = 0;
+}
+
+void copy_to_ps_data_block(const char *from) {
+    clear_ps_data_block();
+    ps_high_water = std::min(std::strlen(from) + 1, PS_DATA_BLOCK_SIZE);
+    std::memcpy(newPSDataBlock, from, ps_high_water);
+    newPSDataBlock[PS_DATA_BLOCK_SIZE - 1] = '\0';
+}
+
+void clear_ps_data_block() {
+    std::memset(newPSDataBlock, 0, ps_high_water);
+    ps_high_water = 0;
+}

@@ -26,3 +26,27 @@ extern char oldPSDataBlock[PS_DATA_BLOCK_SIZE];   // the last pass's process lis
 extern char line[LINE_SIZE];                      // scratch for composed lines
 extern char words[WORD_COUNT][WORD_SIZE];         // scratch for split lines, one word a slot
 extern char file_buffer[FILE_BUFFER_SIZE];        // snapshot text staged for the next flush
+
+// Appending to primaryDataBlock. Every append goes through these, which keep the length of its
+// text, so that an append costs what it adds, and never write past the block's end: what does not
+// fit is dropped and the text stays terminated.
+
+// The output-block rule of every check: the line and "\n\r" go in when the line's length + 5 is
+// below outbufferleft, which then drops by length + 3; otherwise, once a pass (pdboverflow), the
+// line "No room to output more lines... \n\r" goes in and outbufferleft becomes 4.
+void append_data_line(const char *text);
+// A section header goes in whole, and its length is added to outbufferleft (added: that has always
+// been the rule for headers).
+void append_header_line(const char *text);
+// Text that goes in without regard to outbufferleft.
+void append_unbudgeted(const char *text);
+// The length of the text in primaryDataBlock.
+size_t primary_data_length();
+// Empties primaryDataBlock, clearing only as far as anything was written since the last clear.
+void clear_primary_data_block();
+
+// newPSDataBlock takes the text from `from` on, as much of it as the block holds; its last byte is
+// always NUL, so a longer text keeps its first 249,999 bytes. Whatever it held before is cleared.
+void copy_to_ps_data_block(const char *from);
+// Empties newPSDataBlock, clearing only as far as anything was written since the last clear.
+void clear_ps_data_block();

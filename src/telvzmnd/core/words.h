@@ -1,0 +1,21 @@
+// Splitting a line into the shared `words` and reading number words, as the monitor has always
+// done it with sscanf's "%s" and atoi, but never writing past a word's slot.
+#pragma once
+
+#include <cstdint>
+
+// The white space of "%s", as sscanf knows it in the C locale.
+inline bool is_blank(char c) {
+    return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
+}
+
+// Splits `text` into the first `count` slots of `words`, as sscanf with `count` "%s" would. A word
+// is cut at 249 characters and the rest of it skipped, so it never spills into the next slot.
+// Slots after the last word found keep what they held: a short line keeps words of the line before
+// it, as it always has. Returns the number of words found.
+int split_words(const char *text, int count);
+
+// A number word as atoi reads it: leading blanks and a sign, then digits up to the first other
+// character; a word without digits is 0. A number beyond the 32-bit range, where atoi gives no
+// defined value, reads as the nearest end of the range, so that a huge limit stays a huge limit.
+int32_t read_number(const char *word);
