@@ -1,6 +1,7 @@
 #include "recording_platform.h"
 
 #include <array>
+#include <atomic>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
@@ -39,6 +40,7 @@ struct State {
     std::map<std::pair<std::string, std::string>, void *> functions;
     std::map<void *, std::string> allocations;
     std::string directory;
+    std::atomic<uint32_t> pid{0}; // 0 = the process's own
 };
 
 // Never destroyed: the clean-up of the data directory at exit, and any trace of a static
@@ -187,8 +189,13 @@ std::vector<std::string> live_allocations() {
     return live;
 }
 
+void set_pid(uint32_t pid) {
+    state().pid = pid;
+}
+
 void reset() {
     State &s = state();
+    s.pid = 0;
     {
         std::lock_guard guard(s.lock);
         s.traces.clear();
@@ -314,7 +321,8 @@ int tracesvc_dump_bytes(const char *title, const void *data, uint32_t length) {
 }
 
 uint32_t tracesvc_getpid(void) {
-    return static_cast<uint32_t>(getpid());
+    uint32_t pid = rec::state().pid;
+    return pid != 0 ? pid : static_cast<uint32_t>(getpid());
 }
 
 uint32_t logsvc_microcode_log(void *record, uint32_t *crc) {

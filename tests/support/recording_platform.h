@@ -69,6 +69,10 @@ void register_function(const std::string &module, const std::string &function, v
 // Blocks of the debugging allocator still live, as "file:line" each.
 std::vector<std::string> live_allocations();
 
+// What tracesvc_getpid returns from now on: `pid`, or this process's own pid when 0 (as after each
+// reset).
+void set_pid(uint32_t pid);
+
 // Back to a fresh platform: no traces, events, failures, registered functions, allocations
 // remembered; a new empty data directory.
 void reset();
