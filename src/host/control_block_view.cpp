@@ -54,3 +54,9 @@ void detach_control_block(control_block_view &view) {
         view.block = nullptr;
     }
 }
+
+std::array<uint32_t, 6> entry_limits(const override_entry &entry) {
+    return {read_field(entry.rss_limit),        read_field(entry.dsiz_limit),
+            read_field(entry.vsize_limit),      read_field(entry.rss_abort_limit),
+            read_field(entry.dsiz_abort_limit), read_field(entry.vsize_abort_limit)};
+}

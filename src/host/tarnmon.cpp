@@ -1,4 +1,5 @@
 // tarnmon: the command-line host of the monitor library.
+#include <cstdint>
 #include <cstdio>
 #include <span>
 #include <string>
@@ -8,30 +9,52 @@
 
 namespace {
 
+constexpr value_option FILE_OPTION[] = {{"--file", "PATH", &command_line::file}};
+constexpr std::span<const value_option> NO_OPTIONS;
+
 struct command {
     std::string_view name;
     int (*run)(const command_line &line);
-    std::string_view arguments; // what follows the name in its usage
+    std::span<const value_option> options; // the options that take a value
+    std::string_view arguments;            // what follows the options in its usage
     std::string_view summary;
     size_t max_operands;
-    bool takes_file; // --file PATH
+    // The first operand and every word after it are a program and its arguments: they are the
+    // program's, whatever they begin with.
+    bool runs_program;
+    std::string_view exit_note; // what its --help adds to the exit statuses
 };
 
 constexpr command COMMANDS[] = {
-    {"status", command_status, "", "show the control block of a running monitor", 0, false},
-    {"stop", command_stop, "", "ask the running monitor to end after its pass", 0, false},
-    {"check-config", command_check_config, "[FILE]",
-     "check a control file as the monitor would read it", 1, false},
-    {"snapshots", command_snapshots, "[--file PATH] [N|last]",
-     "list the snapshot file, or show snapshot N or the last problem one", 1, true},
+    {"status", command_status, NO_OPTIONS, "", "show the control block of a running monitor", 0,
+     false, ""},
+    {"stop", command_stop, NO_OPTIONS, "", "ask the running monitor to end after its pass", 0,
+     false, ""},
+    {"check-config", command_check_config, NO_OPTIONS, "[FILE]",
+     "check a control file as the monitor would read it", 1, false, ""},
+    {"snapshots", command_snapshots, FILE_OPTION, "[N|last]",
+     "list the snapshot file, or show snapshot N or the last problem one", 1, false, ""},
+    {"limits", command_limits, LIMIT_OPTIONS, "-- COMMAND [ARGS]",
+     "run COMMAND under memory limits of its own (KB, 0..4194304; 0 = none)", SIZE_MAX, true,
+     "once COMMAND runs, the exit status is its own; 126 COMMAND cannot be run, 127 no such "
+     "COMMAND\n"},
+    {"overrides", command_overrides, NO_OPTIONS, "",
+     "list the memory limits that processes set for themselves", 0, false, ""},
 };
 
 constexpr const char *EXIT_STATUSES =
     "exit status: 0 fine, 1 finding, 2 usage error, 3 not available\n";
 
-// "check-config [FILE]": the command as its usage shows it.
+// "snapshots [--file PATH] [N|last]": the command as its usage shows it.
 std::string synopsis(const command &c) {
     std::string text(c.name);
+    for (const auto &option : c.options) {
+        text += " [";
+        text += option.name;
+        text += ' ';
+        text += option.placeholder;
+        text += ']';
+    }
     if (!c.arguments.empty()) {
         text += ' ';
         text += c.arguments;
@@ -45,7 +68,8 @@ void print_usage(FILE *out, const command &c) {
 
 void print_help(const command &c) {
     print_usage(stdout, c);
-    std::printf("%.*s\n\n%s", static_cast<int>(c.summary.size()), c.summary.data(), EXIT_STATUSES);
+    std::printf("%.*s\n\n%s%.*s", static_cast<int>(c.summary.size()), c.summary.data(),
+                EXIT_STATUSES, static_cast<int>(c.exit_note.size()), c.exit_note.data());
 }
 
 void print_commands(FILE *out) {
@@ -66,23 +90,35 @@ void print_commands(FILE *out) {
 
 enum class parsed { run, help, wrong };
 
+const value_option *option_named(const command &c, std::string_view word) {
+    for (const auto &option : c.options) {
+        if (option.name == word) {
+            return &option;
+        }
+    }
+    return nullptr;
+}
+
 // Sorts the words after the command's name into `line`. "--" ends the options, so that an operand
-// may begin with '-'; before it, every word that begins with '-' must be an option of the command
-// ("-" too: no command reads standard input).
+// may begin with '-'; so does the program of a command that runs one. Before that, every word that
+// begins with '-' must be an option of the command ("-" too: no command reads standard input), and
+// an option that takes a value takes the next word, whatever it is.
 parsed parse(const command &c, std::span<char *const> words, command_line *line) {
     bool options = true;
     for (size_t i = 0; i < words.size(); ++i) {
         std::string_view word = words[i];
+        const value_option *option = options ? option_named(c, word) : nullptr;
         if (options && word == "--") {
             options = false;
         } else if (options && (word == "--help" || word == "-h")) {
             return parsed::help;
-        } else if (options && c.takes_file && word == "--file" && i + 1 < words.size()) {
-            line->file = words[++i];
+        } else if (option != nullptr && i + 1 < words.size()) {
+            line->*option->value = words[++i];
         } else if (options && word.starts_with('-')) {
             return parsed::wrong;
         } else {
             line->operands.push_back(words[i]);
+            options = options && !c.runs_program;
         }
     }
     return line->operands.size() <= c.max_operands ? parsed::run : parsed::wrong;
