@@ -23,40 +23,12 @@
 #include <vector>
 
 #include "cpu/process_listing.h"
+#include "support/idle_processes.h"
 #include "tracesvc.h"
 
 extern char **environ;
 
 namespace {
-
-// Idle children that only make /proc longer; ended by their pids.
-class idle_processes {
-  public:
-    ~idle_processes() { resize(0); }
-
-    void resize(size_t count) {
-        while (pids_.size() > count) {
-            pid_t pid = pids_.back();
-            pids_.pop_back();
-            kill(pid, SIGKILL);
-            waitpid(pid, nullptr, 0);
-        }
-        const char *argv[] = {"sleep", "1000", nullptr};
-        while (pids_.size() < count) {
-            pid_t pid = 0;
-            int error = posix_spawn(&pid, "/bin/sleep", nullptr, nullptr, const_cast<char **>(argv),
-                                    environ);
-            if (error != 0) {
-                std::fprintf(stderr, "posix_spawn /bin/sleep: %s\n", std::strerror(error));
-                std::exit(1);
-            }
-            pids_.push_back(pid);
-        }
-    }
-
-  private:
-    std::vector<pid_t> pids_;
-};
 
 idle_processes idle;
 clock_t stepped_ticks;
@@ -65,19 +37,6 @@ long tick_rate;
 clock_t one_second_later() {
     stepped_ticks += tick_rate;
     return stepped_ticks;
-}
-
-int pids_in_proc() {
-    int count = 0;
-    DIR *directory = opendir("/proc/");
-    for (const dirent *found = directory != nullptr ? readdir(directory) : nullptr;
-         found != nullptr; found = readdir(directory)) {
-        count += std::atoi(found->d_name) != 0 ? 1 : 0;
-    }
-    if (directory != nullptr) {
-        closedir(directory);
-    }
-    return count;
 }
 
 void report_per_pid(benchmark::State &state, int pids) {

@@ -1,0 +1,44 @@
+#include "idle_processes.h"
+
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <dirent.h>
+#include <spawn.h>
+#include <sys/wait.h>
+
+extern char **environ;
+
+void idle_processes::resize(size_t count) {
+    while (pids_.size() > count) {
+        pid_t pid = pids_.back();
+        pids_.pop_back();
+        kill(pid, SIGKILL);
+        waitpid(pid, nullptr, 0);
+    }
+    const char *argv[] = {"sleep", "1000", nullptr};
+    while (pids_.size() < count) {
+        pid_t pid = 0;
+        int error =
+            posix_spawn(&pid, "/bin/sleep", nullptr, nullptr, const_cast<char **>(argv), environ);
+        if (error != 0) {
+            std::fprintf(stderr, "posix_spawn /bin/sleep: %s\n", std::strerror(error));
+            std::exit(1);
+        }
+        pids_.push_back(pid);
+    }
+}
+
+int pids_in_proc() {
+    int count = 0;
+    DIR *directory = opendir("/proc/");
+    for (const dirent *found = directory != nullptr ? readdir(directory) : nullptr;
+         found != nullptr; found = readdir(directory)) {
+        count += std::atoi(found->d_name) != 0 ? 1 : 0;
+    }
+    if (directory != nullptr) {
+        closedir(directory);
+    }
+    return count;
+}

@@ -1,0 +1,23 @@
+// Idle children that only make the process table longer, for benchmarks at a given process count;
+// started with posix_spawn and ended by their pids.
+#pragma once
+
+#include <cstddef>
+#include <sys/types.h>
+#include <vector>
+
+class idle_processes {
+  public:
+    idle_processes() = default;
+    ~idle_processes() { resize(0); }
+    idle_processes(const idle_processes &) = delete;
+    idle_processes &operator=(const idle_processes &) = delete;
+
+    void resize(size_t count);
+
+  private:
+    std::vector<pid_t> pids_;
+};
+
+// The pids in /proc now.
+int pids_in_proc();
