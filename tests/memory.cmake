@@ -6,3 +6,5 @@ tarn_library_test(command_runner_test command_runner_test.cpp support/fake_comma
 tarn_library_test(data_blocks_test data_blocks_test.cpp)
 tarn_library_test(pp_memory_test pp_memory_test.cpp support/fake_commands.cpp
                   support/private_ipc.cpp CONTROL_BLOCK)
+# One test runs tarnmon limits and checks a listing of the command it ran.
+add_dependencies(pp_memory_test tarnmon)

@@ -2,15 +2,20 @@
 
 #include <algorithm>
 #include <array>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
+#include <fcntl.h>
 #include <filesystem>
 #include <ostream>
 #include <regex.h>
+#include <spawn.h>
 #include <string>
 #include <sys/ipc.h>
 #include <sys/sem.h>
 #include <sys/shm.h>
+#include <sys/wait.h>
+#include <unistd.h>
 #include <vector>
 
 #include "command_runner.h"
@@ -23,6 +28,8 @@
 #include "memory/pp_memory.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+
+extern char **environ;
 
 namespace {
 
@@ -1166,6 +1173,61 @@ TEST_F(PpMemory, ListingCopyKeepsItsFirst249999Bytes) {
     EXPECT_EQ(std::string(newPSDataBlock, PS_DATA_BLOCK_SIZE - 1),
               text.substr(0, PS_DATA_BLOCK_SIZE - 1));
     EXPECT_EQ(newPSDataBlock[PS_DATA_BLOCK_SIZE - 1], '\0');
+}
+
+// ---- A process that set its own limits through tarnmon ----
+
+// Starts `argv` with its standard output on a pipe; returns the pid, and the read end in *out.
+pid_t start_with_output(const std::vector<std::string> &argv, int *out) {
+    int ends[2];
+    EXPECT_EQ(pipe2(ends, O_CLOEXEC), 0);
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, ends[1], STDOUT_FILENO);
+    std::vector<char *> vector;
+    for (const std::string &word : argv) {
+        vector.push_back(const_cast<char *>(word.c_str()));
+    }
+    vector.push_back(nullptr);
+    pid_t pid = 0;
+    EXPECT_EQ(posix_spawn(&pid, vector[0], &actions, nullptr, vector.data(), environ), 0);
+    posix_spawn_file_actions_destroy(&actions);
+    close(ends[1]);
+    *out = ends[0];
+    return pid;
+}
+
+TEST_F(PpMemory, LimitsThatTarnmonSetAreAppliedToTheCommandItRuns) {
+    int out = -1;
+    pid_t pid = start_with_output({std::string(std::getenv("TARN_BUILD_DIR")) + "/tarnmon",
+                                   "limits", "--rss", "100", "--rss-abort", "500", "--", "/bin/sh",
+                                   "-c", "echo ready; exec sleep 30"},
+                                  &out);
+    char ready[6] = {};
+    ASSERT_EQ(read(out, ready, 5), 5);
+    ASSERT_STREQ(ready, "ready");
+    const override_entry *entry = nullptr;
+    for (const override_entry &candidate : block->override_table) {
+        if (candidate.in_use == 1 && candidate.pid == static_cast<uint32_t>(pid)) {
+            entry = &candidate;
+        }
+    }
+    ASSERT_NE(entry, nullptr);
+    EXPECT_EQ(entry->rss_limit, 100u);
+    EXPECT_EQ(entry->rss_abort_limit, 500u);
+
+    // Without its entry the process would pass: the control file sets no limit.
+    std::string line = ps_line({.pid = pid, .rss = "300", .name = "sleep"});
+    EXPECT_EQ(check_with_ps({line}), 0u);
+    EXPECT_EQ(takeLogCrc, PROCESS_RSS);
+    EXPECT_EQ(takeLogValue, 300);
+    EXPECT_EQ(killPid, 0);
+    EXPECT_EQ(entry->seen, 1u);
+    EXPECT_EQ(top_text(), top_text_for(finding::log, line));
+
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    close(out);
 }
 
 } // namespace
