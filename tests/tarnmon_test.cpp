@@ -400,13 +400,25 @@ TEST_F(Tarnmon, LimitsEndsAsTheCommandEnds) {
         run_command({tarnmon(), "limits", "--rss", "1", "--", "/bin/sh", "-c", "exit 7"}).status,
         7);
     // Without "--" the command's own options are still its own.
-    command_result r = run_command({tarnmon(), "limits", "/bin/sh", "-c", "echo $0 --rss"});
+    command_result r =
+        run_command({tarnmon(), "limits", "--rss", "0", "/bin/sh", "-c", "echo $0 --rss"});
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_EQ(r.out, "/bin/sh --rss\n");
     EXPECT_EQ(r.err, "");
-    // No limit at all is an entry of zeros: the control file's limits apply.
+    // Limits of 0 make an entry of zeros: the defaults of the control file apply, its per-name
+    // rows no longer do.
     EXPECT_EQ(block->override_table[1].in_use, 1u);
     EXPECT_EQ(block->override_table[1].rss_limit, 0u);
+}
+
+TEST_F(Tarnmon, LimitsWithoutALimitOptionIsAUsageError) {
+    create_block();
+    create_lock();
+    command_result r = run_command({tarnmon(), "limits", "--", "/bin/sh", "-c", "echo ran"});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_EQ(r.out, "");
+    EXPECT_TRUE(r.err.starts_with("tarnmon: limits needs at least one limit option\n")) << r.err;
+    EXPECT_EQ(block->override_table[0].in_use, 0u);
 }
 
 TEST_F(Tarnmon, LimitsGivesTheCommandItsEnvironmentAndKeepsItsOwnTraceOutOfTheMonitorsFiles) {

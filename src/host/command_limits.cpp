@@ -119,6 +119,14 @@ int command_limits(const command_line &line) {
         std::fprintf(stderr, "tarnmon: limits needs a command to run\n");
         return EXIT_USAGE;
     }
+    // An entry takes its process out of the control file's per-name rows, whatever limits it
+    // holds: an entry nobody asked for would do that unseen.
+    if (std::ranges::all_of(LIMIT_OPTIONS, [&line](const value_option &option) {
+            return line.*option.value == nullptr;
+        })) {
+        std::fprintf(stderr, "tarnmon: limits needs at least one limit option\n");
+        return EXIT_USAGE;
+    }
     limit_values limits{};
     for (size_t i = 0; i < limits.size(); ++i) {
         if (!parse_limit(LIMIT_OPTIONS[i], line.*LIMIT_OPTIONS[i].value, &limits[i])) {

@@ -35,7 +35,7 @@ constexpr command COMMANDS[] = {
     {"snapshots", command_snapshots, FILE_OPTION, "[N|last]",
      "list the snapshot file, or show snapshot N or the last problem one", 1, false, ""},
     {"limits", command_limits, LIMIT_OPTIONS, "-- COMMAND [ARGS]",
-     "run COMMAND under memory limits of its own (KB, 0..4194304; 0 = none)", SIZE_MAX, true,
+     "run COMMAND under memory limits of its own (KB, 0..4194304; 0 = the default)", SIZE_MAX, true,
      "once COMMAND runs, the exit status is its own; 126 COMMAND cannot be run, 127 no such "
      "COMMAND\n"},
     {"overrides", command_overrides, NO_OPTIONS, "",
