@@ -1197,18 +1197,47 @@ pid_t start_with_output(const std::vector<std::string> &argv, int *out) {
     return pid;
 }
 
+// The command that tarnmon limits became; ended with the test, whatever its asserts did.
+class limited_command {
+  public:
+    explicit limited_command(const std::vector<std::string> &argv)
+        : pid_(start_with_output(argv, &out_)) {}
+    ~limited_command() {
+        if (pid_ > 0) {
+            kill(pid_, SIGKILL);
+            waitpid(pid_, nullptr, 0);
+        }
+        close(out_);
+    }
+    limited_command(const limited_command &) = delete;
+    limited_command &operator=(const limited_command &) = delete;
+
+    pid_t pid() const { return pid_; }
+    // The first `length` bytes it printed.
+    std::string first_output(size_t length) const {
+        std::string text(length, '\0');
+        ssize_t got = read(out_, text.data(), length);
+        text.resize(got > 0 ? static_cast<size_t>(got) : 0);
+        return text;
+    }
+
+  private:
+    int out_ = -1;
+    pid_t pid_;
+};
+
 TEST_F(PpMemory, LimitsThatTarnmonSetAreAppliedToTheCommandItRuns) {
-    int out = -1;
-    pid_t pid = start_with_output({std::string(std::getenv("TARN_BUILD_DIR")) + "/tarnmon",
-                                   "limits", "--rss", "100", "--rss-abort", "500", "--", "/bin/sh",
-                                   "-c", "echo ready; exec sleep 30"},
-                                  &out);
-    char ready[6] = {};
-    ASSERT_EQ(read(out, ready, 5), 5);
-    ASSERT_STREQ(ready, "ready");
+    const char *build = std::getenv("TARN_BUILD_DIR");
+    ASSERT_NE(build, nullptr);
+    limited_command command({std::string(build) + "/tarnmon", "limits", "--rss", "100",
+                             "--rss-abort", "500", "--", "/bin/sh", "-c",
+                             "echo ready; exec sleep 30"});
+    ASSERT_GT(command.pid(), 0);
+    ASSERT_EQ(command.first_output(5), "ready");
+    auto pid = static_cast<uint32_t>(command.pid());
     const override_entry *entry = nullptr;
     for (const override_entry &candidate : block->override_table) {
-        if (candidate.in_use == 1 && candidate.pid == static_cast<uint32_t>(pid)) {
+        if (candidate.in_use == 1 && candidate.pid == pid) {
             entry = &candidate;
         }
     }
@@ -1217,17 +1246,13 @@ TEST_F(PpMemory, LimitsThatTarnmonSetAreAppliedToTheCommandItRuns) {
     EXPECT_EQ(entry->rss_abort_limit, 500u);
 
     // Without its entry the process would pass: the control file sets no limit.
-    std::string line = ps_line({.pid = pid, .rss = "300", .name = "sleep"});
+    std::string line = ps_line({.pid = command.pid(), .rss = "300", .name = "sleep"});
     EXPECT_EQ(check_with_ps({line}), 0u);
     EXPECT_EQ(takeLogCrc, PROCESS_RSS);
     EXPECT_EQ(takeLogValue, 300);
     EXPECT_EQ(killPid, 0);
     EXPECT_EQ(entry->seen, 1u);
     EXPECT_EQ(top_text(), top_text_for(finding::log, line));
-
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
-    close(out);
 }
 
 } // namespace

@@ -27,16 +27,17 @@ extern char line[LINE_SIZE];                      // scratch for composed lines
 extern char words[WORD_COUNT][WORD_SIZE];         // scratch for split lines, one word a slot
 extern char file_buffer[FILE_BUFFER_SIZE];        // snapshot text staged for the next flush
 
-// Appending to primaryDataBlock. Every append goes through these, which keep the length of its
-// text, so that an append costs what it adds, and never write past the block's end: what does not
-// fit is dropped and the text stays terminated.
+// Appending to primaryDataBlock. Every write of the block goes through these, its clear included:
+// they keep the length of its text, so that an append costs what it adds, and how far it was
+// written, so that a clear costs what was written. They never write past the block's end: what
+// does not fit is dropped and the text stays terminated.
 
 // The output-block rule of every check: the line and "\n\r" go in when the line's length + 5 is
 // below outbufferleft, which then drops by length + 3; otherwise, once a pass (pdboverflow), the
 // line "No room to output more lines... \n\r" goes in and outbufferleft becomes 4.
 void append_data_line(const char *text);
-// A section header goes in whole, and its length is added to outbufferleft (added: that has always
-// been the rule for headers).
+// A section header goes in (as far as the block holds it), and its length is added to outbufferleft
+// (added: that has always been the rule for headers).
 void append_header_line(const char *text);
 // Text that goes in without regard to outbufferleft.
 void append_unbudgeted(const char *text);

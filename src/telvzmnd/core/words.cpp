@@ -8,6 +8,7 @@
 int split_words(const char *text, int count) {
     const char *at = text;
     int found = 0;
+    count = std::min(count, static_cast<int>(WORD_COUNT));
     for (; found < count; ++found) {
         while (is_blank(*at)) {
             ++at;

@@ -147,14 +147,15 @@ void record_process(pp_memory_pass &pass, int32_t pid, int32_t rss, int32_t dsiz
     row.vsize = static_cast<uint32_t>(vsize);
 }
 
+// `tookLog` as the line's sizes were guarded with it: another party may change it meanwhile.
 void judge_rss(pp_memory_pass &pass, const char *text, int32_t pid, int32_t rss, int32_t vsize,
-               const limits &in_force) {
+               const limits &in_force, uint32_t tookLog) {
     if (in_force.rss <= 0 || rss <= in_force.rss) {
         return;
     }
     bool abort = in_force.rss_abort > 0 && rss > in_force.rss_abort;
     *pass.takeLogCrc = TAKE_LOG_SUPPRESSED;
-    if (read_field(*pass.tookLog) != 0) {
+    if (tookLog != 0) {
         return;
     }
     tracesvc_trace(abort ? "TARNMNDF: RSS Abort threshold exceeded"
@@ -261,7 +262,7 @@ void pp_memory_line(pp_memory_pass &pass, const char *text) {
     int32_t vsize = read_size(words[3], tookLog);
     int32_t dsiz = read_size(words[4], tookLog);
     record_process(pass, pid, rss, dsiz, vsize);
-    judge_rss(pass, text, pid, rss, vsize, in_force);
+    judge_rss(pass, text, pid, rss, vsize, in_force, tookLog);
 }
 
 TARN_EXPORT uint32_t tarn_check_pp_memory(int32_t *takeLogCrc, int32_t *takeLogValue,
