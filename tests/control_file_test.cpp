@@ -3,9 +3,14 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
 #include <random>
 #include <string>
 #include <vector>
+
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include "control_file_fixture.h"
 #include "core/control_file.h"
@@ -415,6 +420,193 @@ TEST_F(ControlFile, InvalidLastAbortExpressionLeavesTheRowUnfilled) {
     EXPECT_EQ(aborttable[1].compiled, 0u);
     EXPECT_EQ(aborttable[1].rss_abort_limit, 0); // limits are set only when the row compiled
     EXPECT_STREQ(aborttable[1].process_mask, "a\\{1");
+}
+
+// The trace of a row whose repetitions are beyond the budget, for `expression` and `reason`.
+std::string budget_trace(const std::string &expression, const std::string &reason) {
+    return "TARNMNDF: expression [" + expression + "] not compiled: " + reason;
+}
+
+const std::string COUNT_REASON = "a counted repetition asks for more than 255 copies";
+const std::string NESTED_REASON =
+    "counted repetitions nested in groups multiply to more than 255 copies";
+const std::string EXPANSION_REASON = "its repetitions would expand it by more than 512 parts";
+
+TEST_F(ControlFile, LogExpressionBeyondTheBudgetFaresAsOneThatDoesNotCompile) {
+    EXPECT_EQ(parse("PROCESS_LOG_THRESHOLDS 1 1 1 1 a\\{1,32767\\}\n"
+                    "PROCESS_LOG_THRESHOLDS 10 20 30 1 ^java$\n"),
+              0u);
+    EXPECT_EQ(crc, 0u);
+    ASSERT_EQ(num_log_thresholds, 2);
+    EXPECT_STREQ(logtable[0].process_mask, "^java$");
+    EXPECT_EQ(logtable[0].compiled, 1u);
+    EXPECT_EQ(logtable[0].rss_limit, 10);
+    EXPECT_EQ(logtable[0].dsiz_limit, 20);
+    EXPECT_EQ(logtable[0].vsize_limit, 30);
+    EXPECT_EQ(logtable[0].memoryCheckFlag, 1);
+    EXPECT_EQ(logtable[1].compiled, 0u);
+    EXPECT_STREQ(logtable[1].process_mask, "");
+    EXPECT_TRUE(rec::events().empty());
+
+    // One trace, between the second pass's lines of the rejected row and of the next one.
+    const std::string rejected = budget_trace("a\\{1,32767\\}", COUNT_REASON);
+    EXPECT_EQ(rec::traces_starting("TARNMNDF: expression ["), std::vector<std::string>{rejected});
+    int at = rec::find_trace(rejected);
+    ASSERT_GT(at, 0);
+    EXPECT_EQ(rec::traces()[static_cast<size_t>(at) - 1],
+              second_pass({"PROCESS_LOG_THRESHOLDS", "1", "1", "1", "1", "a\\{1,32767\\}",
+                           "PROCESS_LOG_THRESHOLDS", "10", "20", "30", "1", "^java$"}));
+    EXPECT_EQ(rec::traces()[static_cast<size_t>(at) + 1],
+              second_pass({"PROCESS_LOG_THRESHOLDS", "10", "20", "30", "1", "^java$"}));
+
+    // The checker names the line and the budget's reason in place of the compiler's message.
+    control_file_tables tables{};
+    read_control_file_tables(&tables);
+    ASSERT_EQ(tables.problem_count, 1);
+    EXPECT_EQ(tables.problems[0].kind, control_file_problem_kind::uncompiled_expression);
+    EXPECT_EQ(tables.problems[0].line, 1);
+    EXPECT_STREQ(tables.problems[0].keyword, "PROCESS_LOG_THRESHOLDS");
+    EXPECT_STREQ(tables.problems[0].first, "a\\{1,32767\\}");
+    EXPECT_EQ(tables.problems[0].second, COUNT_REASON);
+}
+
+TEST_F(ControlFile, AbortExpressionBeyondTheBudgetFaresAsOneThatDoesNotCompile) {
+    EXPECT_EQ(parse("ACTUALLY_RUN\n"
+                    "PROCESS_ABORT_THRESHOLDS 1 2 3 \\(a\\{1,16\\}\\)\\{1,16\\}\n"
+                    "PROCESS_ABORT_THRESHOLDS 4 5 6 ^db$\n"
+                    "PROCESS_ABORT_THRESHOLDS 7 8 9 \\(ab\\)\\{1,172\\}\n"),
+              0u);
+    ASSERT_EQ(num_abort_thresholds, 3);
+    EXPECT_STREQ(aborttable[0].process_mask, "^db$");
+    EXPECT_EQ(aborttable[0].compiled, 1u);
+    EXPECT_EQ(aborttable[0].rss_abort_limit, 4);
+    EXPECT_EQ(aborttable[0].dsiz_abort_limit, 5);
+    EXPECT_EQ(aborttable[0].vsize_abort_limit, 6);
+    // The last rejected text stays in its row, as a last row the compiler refused does.
+    EXPECT_STREQ(aborttable[1].process_mask, "\\(ab\\)\\{1,172\\}");
+    EXPECT_EQ(aborttable[1].compiled, 0u);
+    EXPECT_EQ(aborttable[1].rss_abort_limit, 0);
+    EXPECT_EQ(aborttable[2].compiled, 0u);
+    EXPECT_TRUE(rec::events().empty());
+    EXPECT_EQ(rec::traces_starting("TARNMNDF: expression ["),
+              (std::vector<std::string>{budget_trace("\\(a\\{1,16\\}\\)\\{1,16\\}", NESTED_REASON),
+                                        budget_trace("\\(ab\\)\\{1,172\\}", EXPANSION_REASON)}));
+
+    control_file_tables tables{};
+    read_control_file_tables(&tables);
+    ASSERT_EQ(tables.problem_count, 2);
+    EXPECT_EQ(tables.problems[0].line, 2);
+    EXPECT_STREQ(tables.problems[0].keyword, "PROCESS_ABORT_THRESHOLDS");
+    EXPECT_EQ(tables.problems[0].second, NESTED_REASON);
+    EXPECT_EQ(tables.problems[1].line, 4);
+    EXPECT_EQ(tables.problems[1].second, EXPANSION_REASON);
+}
+
+TEST_F(ControlFile, CompilerRefusalStaysSilentBesideTheBudget) {
+    // An ill-formed count is the compiler's to refuse: no trace, the compiler's own message.
+    parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 a\\{1,99999x\\}\n");
+    EXPECT_EQ(logtable[0].compiled, 0u);
+    EXPECT_TRUE(rec::traces_starting("TARNMNDF: expression [").empty());
+    control_file_tables tables{};
+    read_control_file_tables(&tables);
+    ASSERT_EQ(tables.problem_count, 1);
+    EXPECT_NE(tables.problems[0].second, COUNT_REASON);
+    EXPECT_STRNE(tables.problems[0].second, "");
+}
+
+struct budget_case {
+    const char *expression;
+    const char *reason; // null: compiled as written
+};
+
+// Each expression alone in a log row and in an abort row.
+const budget_case BUDGET_CASES[] = {
+    {"a\\{255\\}", nullptr},
+    {"a\\{1,255\\}", nullptr},
+    {"a\\{256\\}", COUNT_REASON.c_str()},
+    {"a\\{1,256\\}", COUNT_REASON.c_str()},
+    {"a\\{1,\\}", nullptr},
+    {"a\\{255,\\}", nullptr},
+    {"a\\{256,\\}", COUNT_REASON.c_str()},
+    {"a*", nullptr},
+    {"\\(a\\{1,15\\}\\)\\{1,17\\}", nullptr},
+    {"\\(a\\{1,16\\}\\)\\{1,16\\}", NESTED_REASON.c_str()},
+    {"[\\{1,999\\}]", nullptr},
+    {"[]\\{1,999\\}]", nullptr},
+    {"[^]\\{1,999\\}]", nullptr},
+    {"[[:alpha:]\\{1,999\\}]", nullptr},
+    {"a\\{1,255\\}b\\{1,255\\}c\\{1,5\\}", nullptr},
+    {"a\\{1,255\\}b\\{1,255\\}c\\{1,6\\}", EXPANSION_REASON.c_str()},
+    {"a\\{1,99999999999999999999\\}", COUNT_REASON.c_str()},
+};
+
+TEST_F(ControlFile, BudgetBoundariesInBothTables) {
+    for (const budget_case &one : BUDGET_CASES) {
+        SCOPED_TRACE(one.expression);
+        control_file_test::release_everything();
+        rec::reset();
+        reset_settings();
+        std::string expression = one.expression;
+        parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 " + expression + "\nPROCESS_ABORT_THRESHOLDS 4 5 6 " +
+              expression + "\n");
+        ASSERT_EQ(num_log_thresholds, 1);
+        ASSERT_EQ(num_abort_thresholds, 1);
+        uint32_t compiled = one.reason == nullptr ? 1u : 0u;
+        EXPECT_EQ(logtable[0].compiled, compiled);
+        EXPECT_EQ(aborttable[0].compiled, compiled);
+        std::vector<std::string> expected;
+        if (one.reason != nullptr) {
+            expected.assign(2, budget_trace(expression, one.reason));
+        }
+        EXPECT_EQ(rec::traces_starting("TARNMNDF: expression ["), expected);
+    }
+}
+
+TEST_F(ControlFile, ExpressionsWithinTheBudgetAreCompiledAsWritten) {
+    parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 ^x[\\{1,999\\}]\\{2\\}$\n"
+          "PROCESS_LOG_THRESHOLDS 1 2 3 1 ^a\\{255\\}$\n");
+    ASSERT_EQ(logtable[0].compiled, 1u);
+    ASSERT_EQ(logtable[1].compiled, 1u);
+    // A backslash and "\{" inside brackets are members of the set.
+    EXPECT_EQ(regexec(&logtable[0].expression, "x{9", 0, nullptr, 0), 0);
+    EXPECT_EQ(regexec(&logtable[0].expression, "x\\,", 0, nullptr, 0), 0);
+    EXPECT_EQ(regexec(&logtable[0].expression, "x{", 0, nullptr, 0), REG_NOMATCH);
+    EXPECT_EQ(regexec(&logtable[1].expression, std::string(255, 'a').c_str(), 0, nullptr, 0), 0);
+    EXPECT_EQ(regexec(&logtable[1].expression, std::string(256, 'a').c_str(), 0, nullptr, 0),
+              REG_NOMATCH);
+}
+
+// The line that once held the monitor's start for over a minute and took 6.5 GB: parsed in a child
+// whose address space is capped a few hundred MB above what it has, and which an alarm ends
+// after 10 seconds, it is refused at once.
+TEST_F(ControlFile, HugeCountedRepetitionIsRefusedBeforeTheCompilerSeesIt) {
+#ifndef TARN_SANITIZED
+    long in_use = 0;
+    std::ifstream("/proc/self/statm") >> in_use;
+    in_use *= sysconf(_SC_PAGESIZE);
+    ASSERT_GT(in_use, 0);
+#endif
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+#ifndef TARN_SANITIZED
+        // The sanitizers' shadow memory needs an address space without a cap.
+        auto most = static_cast<rlim_t>(in_use + (384L << 20));
+        struct rlimit cap = {most, most};
+        if (setrlimit(RLIMIT_AS, &cap) != 0) {
+            _exit(10);
+        }
+#endif
+        alarm(10);
+        parse("PROCESS_LOG_THRESHOLDS 1 1 1 1 a\\{1,32767\\}\n");
+        int wrong = logtable[0].compiled != 0 ? 1 : 0;
+        wrong |= rec::has_trace(budget_trace("a\\{1,32767\\}", COUNT_REASON)) ? 0 : 2;
+        _exit(wrong);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 TEST_F(ControlFile, LogExpressionsKeepSubexpressionsAbortOnesDoNot) {

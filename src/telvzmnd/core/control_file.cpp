@@ -5,9 +5,11 @@
 #include <string_view>
 
 #include "allocation.h"
+#include "core/expression_budget.h"
 #include "core/problem_reporting.h"
 #include "core/reason_codes.h"
 #include "core/settings.h"
+#include "core/words.h"
 #include "modsvc.h"
 #include "tracesvc.h"
 
@@ -23,14 +25,11 @@ static_assert(offsetof(log_threshold, expression) + EXPRESSION_DUMP_LENGTH <=
 static_assert(offsetof(abort_threshold, expression) + EXPRESSION_DUMP_LENGTH <=
               sizeof(abort_threshold));
 static_assert(CONTROL_WORD_MAX < PROCESS_MASK_SIZE, "a mask copied from a word stays terminated");
+static_assert(2 * EXPRESSION_NESTING_MAX >= CONTROL_WORD_MAX,
+              "the weighing follows every group a mask can open");
 
 control_file_problem problems[CONTROL_FILE_PROBLEMS_KEPT];
 int32_t problem_count;
-
-// The white space of the word split, as sscanf's "%s" knows it in the C locale.
-bool is_blank(char c) {
-    return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
-}
 
 // Splits the text from a line's first byte into the first 12 slots of `words`. The split does not
 // stop at the line feed: a line of fewer than 12 words takes the rest from the following lines, so
@@ -84,26 +83,6 @@ class word_splitter {
     const char *blank_to = nullptr;
     const char *last_first_word = nullptr;
 };
-
-// A number word as atoi reads it: leading blanks and a sign, then digits up to the first other
-// character; a word without digits is 0. A number beyond the 32-bit range, where atoi gives no
-// defined value, reads as the nearest end of the range, so that a huge limit stays a huge limit.
-int32_t read_number(const char *word) {
-    constexpr int64_t beyond_range = int64_t{INT32_MAX} + 1;
-    const char *at = word;
-    while (is_blank(*at)) {
-        ++at;
-    }
-    bool negative = *at == '-';
-    if (*at == '-' || *at == '+') {
-        ++at;
-    }
-    int64_t magnitude = 0;
-    for (; *at >= '0' && *at <= '9'; ++at) {
-        magnitude = std::min(magnitude * 10 + (*at - '0'), beyond_range);
-    }
-    return static_cast<int32_t>(negative ? -magnitude : std::min(magnitude, beyond_range - 1));
-}
 
 // Copies at most `limit` characters of `from` into the zeroed field `to`.
 void copy_into_zeroed(char *to, const char *from, size_t limit) {
@@ -227,10 +206,20 @@ void note_problem(control_file_problem_kind kind, int32_t line, const char *firs
 }
 
 // Compiles the row's expression; the row counts (its index may advance) only when it compiled.
+// An expression whose repetitions would cost the compiler more than their budget is not handed to
+// it: such a row fares as one the compiler refused, with one trace that says why.
 template <typename Row>
 bool compile_row(Row &row, const char *mask, int flags, int32_t line) {
     std::memset(static_cast<void *>(&row), 0, sizeof row);
     copy_into_zeroed(row.process_mask, mask, PROCESS_MASK_SIZE);
+    expression_weight weight = weigh_expression(row.process_mask);
+    if (!weight.within_budget) {
+        tracesvc_trace("TARNMNDF: expression [%s] not compiled: %s", row.process_mask,
+                       weight.reason);
+        note_problem(control_file_problem_kind::uncompiled_expression, line, row.process_mask,
+                     weight.reason, 0, 0);
+        return false;
+    }
     int result = regcomp(&row.expression, row.process_mask, flags);
     if (result != 0) {
         char message[WORD_SIZE];

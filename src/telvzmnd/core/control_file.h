@@ -77,7 +77,7 @@ struct control_file_problem {
     int32_t line; // 1 = the file's first line
     char keyword[WORD_SIZE];
     char first[WORD_SIZE];  // the expression, or the module
-    char second[WORD_SIZE]; // the compiler's message, or the routine
+    char second[WORD_SIZE]; // why it does not compile, or the routine
     uint32_t rc;            // the module service's result and crc (unresolved routine)
     uint32_t crc;
 };
