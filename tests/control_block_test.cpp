@@ -106,49 +106,21 @@ bool all_zero(const void *memory, size_t length) {
     return true;
 }
 
-// Runs `child` in a forked process and returns its exit status.
-template <typename F>
-pid_t start_child(F child) {
-    pid_t pid = fork();
-    if (pid == 0) {
-        _exit(child());
-    }
-    return pid;
-}
-
-int wait_child(pid_t pid) {
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 100 + WTERMSIG(status);
-}
+using private_ipc::start_child;
+using private_ipc::wait_child;
 
 class ControlBlock : public ::testing::Test {
   protected:
     void SetUp() override {
         REQUIRE_PRIVATE_KEY();
-        // The first segment of a new IPC namespace gets id 0, which the monitor takes for a
-        // failure; use it up so that the blocks of the test get ordinary ids.
-        int first = shmget(IPC_PRIVATE, 16, IPC_CREAT | 0600);
-        shmctl(first, IPC_RMID, nullptr);
+        private_ipc::use_up_id_zero();
         rec::reset();
         script = Script{};
         sysv_ipc = {fake_shmget, fake_shmat, fake_shmctl, fake_semget, fake_semop};
     }
     void TearDown() override {
         sysv_ipc = sysv_ipc_system;
-        if (TARN_CB_PTR != nullptr) {
-            shmdt(TARN_CB_PTR);
-            TARN_CB_PTR = nullptr;
-        }
-        // Leave no block behind for the next test of this process.
-        int id = shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0);
-        if (id != -1) {
-            shmctl(id, IPC_RMID, nullptr);
-        }
-        int sem = semget(static_cast<key_t>(TARN_CB_KEY), 1, 0);
-        if (sem != -1) {
-            semctl(sem, 0, IPC_RMID);
-        }
+        private_ipc::remove_control_block();
     }
 
     uint32_t init() {

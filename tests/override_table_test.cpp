@@ -42,40 +42,14 @@ strings operator+(strings head, const strings &tail) {
     return head;
 }
 
-void remove_ipc_objects() {
-    int id = shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0);
-    if (id != -1) {
-        shmctl(id, IPC_RMID, nullptr);
-    }
-    int sem = semget(static_cast<key_t>(TARN_CB_KEY), 1, 0);
-    if (sem != -1) {
-        semctl(sem, 0, IPC_RMID);
-    }
-}
-
-template <typename F>
-pid_t start_child(F child) {
-    pid_t pid = fork();
-    if (pid == 0) {
-        _exit(child());
-    }
-    return pid;
-}
-
-int wait_child(pid_t pid) {
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 100 + WTERMSIG(status);
-}
+using private_ipc::start_child;
+using private_ipc::wait_child;
 
 class OverrideTable : public ::testing::Test {
   protected:
     void SetUp() override {
         REQUIRE_PRIVATE_KEY();
-        // The first segment of a new IPC namespace gets id 0, which the monitor takes for a
-        // failure; use it up so that the block gets an ordinary id.
-        int first = shmget(IPC_PRIVATE, 16, IPC_CREAT | 0600);
-        shmctl(first, IPC_RMID, nullptr);
+        private_ipc::use_up_id_zero();
         rec::reset();
         uint32_t crc = 0;
         ASSERT_EQ(tarn_init(&crc), 0u);
@@ -83,13 +57,7 @@ class OverrideTable : public ::testing::Test {
         rec::set_pid(OWN_PID);
         rec::clear_traces();
     }
-    void TearDown() override {
-        if (TARN_CB_PTR != nullptr) {
-            shmdt(TARN_CB_PTR);
-            TARN_CB_PTR = nullptr;
-        }
-        remove_ipc_objects();
-    }
+    void TearDown() override { private_ipc::remove_control_block(); }
 
     uint32_t call(int32_t rss, int32_t dsiz, int32_t vsize, int32_t rssAbort, int32_t dsizAbort,
                   int32_t vsizeAbort) {
@@ -344,10 +312,8 @@ TEST_F(OverrideTable, ANullCrcPointerIsRefusedByThePointerCheck) {
 }
 
 TEST_F(OverrideTable, WithoutAControlBlockNothingIsStored) {
-    shmdt(TARN_CB_PTR);
-    TARN_CB_PTR = nullptr; // as in a process that never attached
+    private_ipc::remove_control_block(); // as in a process that never attached
     block = nullptr;
-    remove_ipc_objects();
     EXPECT_EQ(call(100, 0, 0, 0, 0, 0), 0u);
     EXPECT_EQ(crc, 0u);
     EXPECT_EQ(TARN_CB_PTR, nullptr);
@@ -360,10 +326,8 @@ TEST_F(OverrideTable, WithoutAControlBlockNothingIsStored) {
 }
 
 TEST_F(OverrideTable, ASegmentOfAnotherProgramUnderTheKeyIsNeverWritten) {
-    shmdt(TARN_CB_PTR);
-    TARN_CB_PTR = nullptr;
+    private_ipc::remove_control_block();
     block = nullptr;
-    remove_ipc_objects();
     constexpr size_t FOREIGN_SIZE = 4000000;
     int foreign = shmget(static_cast<key_t>(TARN_CB_KEY), FOREIGN_SIZE, IPC_CREAT | 0666);
     ASSERT_NE(foreign, -1);

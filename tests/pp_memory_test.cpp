@@ -315,10 +315,7 @@ class PpMemory : public ::testing::Test {
     void SetUp() override {
         REQUIRE_PRIVATE_KEY();
         key_is_ours = true;
-        // The first segment of a new IPC namespace gets id 0; use it up, as the control block's
-        // own tests do, so that the block gets an ordinary id.
-        int first = shmget(IPC_PRIVATE, 16, IPC_CREAT | 0600);
-        shmctl(first, IPC_RMID, nullptr);
+        private_ipc::use_up_id_zero();
         rec::reset();
         release_tables();
         reset_settings();
@@ -340,18 +337,7 @@ class PpMemory : public ::testing::Test {
         if (!key_is_ours) {
             return; // a monitor's block on this host is none of the test's business
         }
-        if (TARN_CB_PTR != nullptr) {
-            shmdt(TARN_CB_PTR);
-            TARN_CB_PTR = nullptr;
-        }
-        int id = shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0);
-        if (id != -1) {
-            shmctl(id, IPC_RMID, nullptr);
-        }
-        int sem = semget(static_cast<key_t>(TARN_CB_KEY), 1, 0);
-        if (sem != -1) {
-            semctl(sem, 0, IPC_RMID);
-        }
+        private_ipc::remove_control_block();
     }
 
     static void release_tables() {
