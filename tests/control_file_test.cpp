@@ -386,11 +386,9 @@ TEST_F(ControlFile, KeywordTwiceLastWinsAndTableRowsAddUp) {
     EXPECT_EQ(aborttable[0].compiled, 1u);
 }
 
-TEST_F(ControlFile, InvalidFirstLogExpressionIsOverwrittenByTheNextRow) {
-    EXPECT_EQ(parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 [abc\n"
-                    "PROCESS_LOG_THRESHOLDS 10 20 30 1 ^java$\n"),
-              0u);
-    EXPECT_EQ(crc, 0u);
+// Two log rows of which the first did not compile: the second ("10 20 30 1 ^java$") took its
+// place, and row 1 stays empty.
+void expect_second_log_row_in_place_of_the_first() {
     ASSERT_EQ(num_log_thresholds, 2);
     EXPECT_STREQ(logtable[0].process_mask, "^java$");
     EXPECT_EQ(logtable[0].compiled, 1u);
@@ -400,17 +398,32 @@ TEST_F(ControlFile, InvalidFirstLogExpressionIsOverwrittenByTheNextRow) {
     EXPECT_EQ(logtable[0].memoryCheckFlag, 1);
     EXPECT_EQ(logtable[1].compiled, 0u);
     EXPECT_STREQ(logtable[1].process_mask, "");
+}
+
+// The one problem kept for the checker: a log row of line 1 that did not compile.
+const control_file_problem &the_only_problem() {
+    static control_file_tables tables{};
+    read_control_file_tables(&tables);
+    EXPECT_EQ(tables.problem_count, 1);
+    const control_file_problem &problem = tables.problems[0];
+    EXPECT_EQ(problem.kind, control_file_problem_kind::uncompiled_expression);
+    EXPECT_EQ(problem.line, 1);
+    EXPECT_STREQ(problem.keyword, "PROCESS_LOG_THRESHOLDS");
+    return problem;
+}
+
+TEST_F(ControlFile, InvalidFirstLogExpressionIsOverwrittenByTheNextRow) {
+    EXPECT_EQ(parse("PROCESS_LOG_THRESHOLDS 1 2 3 1 [abc\n"
+                    "PROCESS_LOG_THRESHOLDS 10 20 30 1 ^java$\n"),
+              0u);
+    EXPECT_EQ(crc, 0u);
+    expect_second_log_row_in_place_of_the_first();
     EXPECT_TRUE(rec::events().empty()); // dropped without a report
 
     // The dropped row is remembered for the checker.
-    control_file_tables tables{};
-    read_control_file_tables(&tables);
-    ASSERT_EQ(tables.problem_count, 1);
-    EXPECT_EQ(tables.problems[0].kind, control_file_problem_kind::uncompiled_expression);
-    EXPECT_EQ(tables.problems[0].line, 1);
-    EXPECT_STREQ(tables.problems[0].keyword, "PROCESS_LOG_THRESHOLDS");
-    EXPECT_STREQ(tables.problems[0].first, "[abc");
-    EXPECT_STRNE(tables.problems[0].second, "");
+    const control_file_problem &problem = the_only_problem();
+    EXPECT_STREQ(problem.first, "[abc");
+    EXPECT_STRNE(problem.second, "");
 }
 
 TEST_F(ControlFile, InvalidLastAbortExpressionLeavesTheRowUnfilled) {
@@ -437,15 +450,7 @@ TEST_F(ControlFile, LogExpressionBeyondTheBudgetFaresAsOneThatDoesNotCompile) {
                     "PROCESS_LOG_THRESHOLDS 10 20 30 1 ^java$\n"),
               0u);
     EXPECT_EQ(crc, 0u);
-    ASSERT_EQ(num_log_thresholds, 2);
-    EXPECT_STREQ(logtable[0].process_mask, "^java$");
-    EXPECT_EQ(logtable[0].compiled, 1u);
-    EXPECT_EQ(logtable[0].rss_limit, 10);
-    EXPECT_EQ(logtable[0].dsiz_limit, 20);
-    EXPECT_EQ(logtable[0].vsize_limit, 30);
-    EXPECT_EQ(logtable[0].memoryCheckFlag, 1);
-    EXPECT_EQ(logtable[1].compiled, 0u);
-    EXPECT_STREQ(logtable[1].process_mask, "");
+    expect_second_log_row_in_place_of_the_first();
     EXPECT_TRUE(rec::events().empty());
 
     // One trace, between the second pass's lines of the rejected row and of the next one.
@@ -460,14 +465,9 @@ TEST_F(ControlFile, LogExpressionBeyondTheBudgetFaresAsOneThatDoesNotCompile) {
               second_pass({"PROCESS_LOG_THRESHOLDS", "10", "20", "30", "1", "^java$"}));
 
     // The checker names the line and the budget's reason in place of the compiler's message.
-    control_file_tables tables{};
-    read_control_file_tables(&tables);
-    ASSERT_EQ(tables.problem_count, 1);
-    EXPECT_EQ(tables.problems[0].kind, control_file_problem_kind::uncompiled_expression);
-    EXPECT_EQ(tables.problems[0].line, 1);
-    EXPECT_STREQ(tables.problems[0].keyword, "PROCESS_LOG_THRESHOLDS");
-    EXPECT_STREQ(tables.problems[0].first, "a\\{1,32767\\}");
-    EXPECT_EQ(tables.problems[0].second, COUNT_REASON);
+    const control_file_problem &problem = the_only_problem();
+    EXPECT_STREQ(problem.first, "a\\{1,32767\\}");
+    EXPECT_EQ(problem.second, COUNT_REASON);
 }
 
 TEST_F(ControlFile, AbortExpressionBeyondTheBudgetFaresAsOneThatDoesNotCompile) {
