@@ -25,6 +25,7 @@
 #include "core/settings.h"
 #include "data_blocks.h"
 #include "fake_commands.h"
+#include "memory/name_matching.h"
 #include "memory/pp_memory.h"
 #include "private_ipc.h"
 #include "recording_platform.h"

@@ -11,9 +11,8 @@
 #include "core/settings.h"
 #include "core/words.h"
 #include "data_blocks.h"
+#include "memory/name_matching.h"
 #include "tracesvc.h"
-
-name_matcher process_name_matcher = regexec;
 
 namespace {
 
@@ -34,10 +33,6 @@ struct override_index_item {
 override_index_item override_index[OVERRIDE_TABLE_ENTRIES];
 int32_t override_index_size;
 
-// An expression of at most 249 characters has fewer groups than this; regexec is given room for
-// as many matches as it is asked for.
-constexpr size_t MATCH_CAPACITY = PROCESS_MASK_SIZE / 2 + 2;
-
 int32_t find_override(uint32_t pid) {
     const override_index_item *begin = override_index;
     const override_index_item *end = begin + override_index_size;
@@ -54,43 +49,34 @@ void replace_where_set(int32_t &limit, uint32_t value) {
     }
 }
 
-bool matches(const regex_t &expression, const char *name, size_t nmatch) {
-    regmatch_t found[MATCH_CAPACITY];
-    return process_name_matcher(&expression, name, std::min(nmatch, MATCH_CAPACITY), found, 0) == 0;
-}
-
-// The first compiled row of the log table that matches `name` gives its three limits.
+// The first matching row of the log table gives the three limits.
 void apply_log_table(const char *name, limits &in_force) {
-    for (int32_t i = 0; logtable != nullptr && i < num_log_thresholds; ++i) {
-        const log_threshold &row = logtable[i];
-        if (row.compiled == 1 && matches(row.expression, name, row.expression.re_nsub)) {
-            in_force.rss = row.rss_limit;
-            in_force.dsiz = row.dsiz_limit;
-            in_force.vsize = row.vsize_limit;
-            tracesvc_trace("TARNMNDD: found log table match for pname [%s]", name);
-            tracesvc_trace("TARNMNDD: with expression [%s]", row.process_mask);
-            tracesvc_trace("TARNMNDD:   rss = %d, dsiz = %d, vsize = %d (dec)", in_force.rss,
-                           in_force.dsiz, in_force.vsize);
-            return;
-        }
+    const log_threshold *row = first_log_match(name);
+    if (row == nullptr) {
+        return;
     }
+    in_force.rss = row->rss_limit;
+    in_force.dsiz = row->dsiz_limit;
+    in_force.vsize = row->vsize_limit;
+    tracesvc_trace("TARNMNDD: found log table match for pname [%s]", name);
+    tracesvc_trace("TARNMNDD: with expression [%s]", row->process_mask);
+    tracesvc_trace("TARNMNDD:   rss = %d, dsiz = %d, vsize = %d (dec)", in_force.rss, in_force.dsiz,
+                   in_force.vsize);
 }
 
-// The same for the abort table, whose walk has always asked for one match more.
+// The first matching row of the abort table gives the three abort limits.
 void apply_abort_table(const char *name, limits &in_force) {
-    for (int32_t i = 0; aborttable != nullptr && i < num_abort_thresholds; ++i) {
-        const abort_threshold &row = aborttable[i];
-        if (row.compiled == 1 && matches(row.expression, name, row.expression.re_nsub + 1)) {
-            in_force.rss_abort = row.rss_abort_limit;
-            in_force.dsiz_abort = row.dsiz_abort_limit;
-            in_force.vsize_abort = row.vsize_abort_limit;
-            tracesvc_trace("TARNMNDD: found abort table match for pname [%s]", name);
-            tracesvc_trace("TARNMNDD: with expression [%s]", row.process_mask);
-            tracesvc_trace("TARNMNDD:   Abort's Rss = %d, dsiz = %d, vsize = %d (dec)",
-                           in_force.rss_abort, in_force.dsiz_abort, in_force.vsize_abort);
-            return;
-        }
+    const abort_threshold *row = first_abort_match(name);
+    if (row == nullptr) {
+        return;
     }
+    in_force.rss_abort = row->rss_abort_limit;
+    in_force.dsiz_abort = row->dsiz_abort_limit;
+    in_force.vsize_abort = row->vsize_abort_limit;
+    tracesvc_trace("TARNMNDD: found abort table match for pname [%s]", name);
+    tracesvc_trace("TARNMNDD: with expression [%s]", row->process_mask);
+    tracesvc_trace("TARNMNDD:   Abort's Rss = %d, dsiz = %d, vsize = %d (dec)", in_force.rss_abort,
+                   in_force.dsiz_abort, in_force.vsize_abort);
 }
 
 limits limits_for(uint32_t pid, const char *name, tarn_control_block &block) {

@@ -19,12 +19,6 @@ inline constexpr int PS_WORDS = 7; // pid, tid, rss, vsize, dsiz, comm, time
 // already held back by tookLog.
 inline constexpr int32_t PS_SIZE_GUARD = 0x800000;
 
-// Matches a process name against a table row's expression: regexec, reached through this one place
-// so that a test can see how many matches each table's walk asks for.
-using name_matcher = int (*)(const regex_t *expression, const char *name, size_t nmatch,
-                             regmatch_t *found, int flags);
-extern name_matcher process_name_matcher;
-
 // What the check carries from one line of the listing to the next.
 struct pp_memory_pass {
     int32_t *takeLogCrc;
