@@ -17,8 +17,11 @@
 #include "core/sysv_ipc.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+#include "text_lines.h"
 
 namespace {
+
+using text::all_zero;
 
 // What the faked System V calls do and saw; reset by every test.
 struct Script {
@@ -94,16 +97,6 @@ size_t segment_size(int id) {
 
 int semaphore_value(int id) {
     return semctl(id, 0, GETVAL);
-}
-
-bool all_zero(const void *memory, size_t length) {
-    const auto *bytes = static_cast<const unsigned char *>(memory);
-    for (size_t i = 0; i < length; ++i) {
-        if (bytes[i] != 0) {
-            return false;
-        }
-    }
-    return true;
 }
 
 using private_ipc::start_child;

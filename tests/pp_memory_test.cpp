@@ -29,13 +29,18 @@
 #include "memory/pp_memory.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+#include "text_lines.h"
 
 extern char **environ;
 
 namespace {
 
 using fake::fake_commands;
-using lines = std::vector<std::string>;
+using text::all_zero;
+using text::joined;
+using text::left_aligned;
+using text::lines;
+using text::right_aligned;
 
 constexpr char PS_HEADER[] = "  \n\rAbout to output ps data \n\r";
 constexpr int32_t PS_HEADER_LENGTH = 30;
@@ -61,14 +66,6 @@ struct ps_process {
     std::string name = "worker";
     int tid = 0; // 0: the pid
 };
-
-std::string right_aligned(const std::string &word, size_t width) {
-    return word.size() >= width ? word : std::string(width - word.size(), ' ') + word;
-}
-
-std::string left_aligned(const std::string &word, size_t width) {
-    return word.size() >= width ? word : word + std::string(width - word.size(), ' ');
-}
 
 // The line that "ps -e -o pid,tid,rss,vsize,dsiz,comm,time --no-header" prints for `p`.
 std::string ps_line(const ps_process &p) {
@@ -141,10 +138,6 @@ std::string block_text() {
     return std::string(primaryDataBlock, strnlen(primaryDataBlock, PRIMARY_DATA_BLOCK_SIZE));
 }
 
-bool all_zero(const char *from, size_t length) {
-    return std::all_of(from, from + length, [](char c) { return c == '\0'; });
-}
-
 // topDataBlock as text; the bytes after the text must all be NUL.
 std::string top_text() {
     size_t length = strnlen(topDataBlock, TOP_DATA_BLOCK_SIZE);
@@ -193,14 +186,6 @@ lines abort_match_traces(const std::string &name, const std::string &expression,
     return {"TARNMNDD: found abort table match for pname [" + name + "]",
             "TARNMNDD: with expression [" + expression + "]",
             "TARNMNDD:   Abort's Rss = " + limits_text(rss, dsiz, vsize)};
-}
-
-lines joined(std::initializer_list<lines> parts) {
-    lines all;
-    for (const lines &part : parts) {
-        all.insert(all.end(), part.begin(), part.end());
-    }
-    return all;
 }
 
 // The trace lines, each call of the override table's lock routine folded into one line
@@ -316,13 +301,10 @@ class PpMemory : public ::testing::Test {
     void SetUp() override {
         REQUIRE_PRIVATE_KEY();
         key_is_ours = true;
-        private_ipc::use_up_id_zero();
         rec::reset();
         release_tables();
         reset_settings();
-        uint32_t init_crc = 0;
-        ASSERT_EQ(tarn_init(&init_crc), 0u);
-        block = TARN_CB_PTR;
+        block = private_ipc::fresh_control_block();
         ASSERT_NE(block, nullptr);
         // A thread count finding would replace every finding of a line; its tests set their own.
         num_threads_threshold = NO_THREAD_LIMIT;

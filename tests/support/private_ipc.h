@@ -36,6 +36,14 @@ inline void remove_control_block() {
     remove_control_block_objects();
 }
 
+// A control block of the test's own, made by the monitor's tarn_init once id 0 is used up; null
+// when it could not be made. Inline, as above.
+inline tarn_control_block *fresh_control_block() {
+    use_up_id_zero();
+    uint32_t crc = 0;
+    return tarn_init(&crc) == 0 ? TARN_CB_PTR.get() : nullptr;
+}
+
 // Runs `child` in a forked process that ends with its result; returns the pid.
 template <typename F>
 pid_t start_child(F child) {
