@@ -1,3 +1,2 @@
 # The per-process memory check against its command alone, and the start of a child in a large host.
 tarn_benchmark(pp_memory pp_memory.cpp)
-target_compile_definitions(bench_pp_memory PRIVATE TARN_SOURCE_DIR="${PROJECT_SOURCE_DIR}")

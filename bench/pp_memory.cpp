@@ -15,72 +15,20 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <fstream>
-#include <iterator>
-#include <sched.h>
-#include <string>
 #include <sys/mman.h>
-#include <sys/resource.h>
 #include <vector>
 
 #include "command_runner.h"
 #include "core/control_block.h"
-#include "core/control_file.h"
-#include "core/settings.h"
 #include "data_blocks.h"
 #include "memory/pp_memory.h"
+#include "support/cpu_time.h"
 #include "support/idle_processes.h"
+#include "support/monitor_setup.h"
 
 namespace {
 
 idle_processes idle;
-
-double seconds(const timeval &t) {
-    return static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_usec) / 1e6;
-}
-
-// CPU seconds used so far by this process and by its children that were waited for.
-struct cpu_times {
-    double self;
-    double children;
-
-    static cpu_times now() {
-        rusage self_usage{};
-        rusage children_usage{};
-        getrusage(RUSAGE_SELF, &self_usage);
-        getrusage(RUSAGE_CHILDREN, &children_usage);
-        return {seconds(self_usage.ru_utime) + seconds(self_usage.ru_stime),
-                seconds(children_usage.ru_utime) + seconds(children_usage.ru_stime)};
-    }
-};
-
-// Runs `body` once an iteration and reports CPU (own plus children) as the iteration's time.
-template <typename Body>
-void measure_cpu(benchmark::State &state, Body body) {
-    double self = 0;
-    double children = 0;
-    int64_t lines = 0;
-    for (auto _ : state) {
-        cpu_times before = cpu_times::now();
-        lines = body();
-        cpu_times after = cpu_times::now();
-        self += after.self - before.self;
-        children += after.children - before.children;
-        state.SetIterationTime((after.self - before.self) + (after.children - before.children));
-    }
-    auto iterations = static_cast<double>(state.iterations());
-    state.counters["lines"] = static_cast<double>(lines);
-    state.counters["self_ms"] = self / iterations * 1e3;
-    state.counters["children_ms"] = children / iterations * 1e3;
-    state.counters["self_ns_per_line"] =
-        lines > 0 ? self / iterations / static_cast<double>(lines) * 1e9 : 0;
-}
-
-void start_pass() {
-    clear_primary_data_block();
-    outbufferleft = OUTBUFFER_BUDGET;
-    pdboverflow = 0;
-}
 
 void check(benchmark::State &state) {
     idle.resize(static_cast<size_t>(state.range(0)));
@@ -137,34 +85,14 @@ void spawn_one_child(benchmark::State &state) {
     }
 }
 
-// The settings and tables of the example control file, as the monitor reads them at start.
-bool load_example_control_file() {
-    std::ifstream in(std::string(TARN_SOURCE_DIR) + "/examples/telvzopt.trm", std::ios::binary);
-    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    if (text.empty()) {
-        return false;
-    }
-    settings_start_values();
-    uint32_t crc = 0;
-    tarn_parse_control_file(text.c_str(), &crc);
-    return true;
-}
-
 } // namespace
 
 int main(int argc, char **argv) {
-    if (unshare(CLONE_NEWIPC) != 0) {
-        std::fprintf(stderr, "an IPC namespace of its own is needed (run as root): %s\n",
-                     std::strerror(errno));
+    if (!enter_private_ipc()) {
         return 1;
     }
-    char data_dir[] = "/tmp/tarn-bench-XXXXXX";
-    if (std::getenv("TELV_DATA_DIR") == nullptr && mkdtemp(data_dir) != nullptr) {
-        setenv("TELV_DATA_DIR", data_dir, 1);
-    }
-    uint32_t crc = 0;
-    if (!load_example_control_file() || tarn_init(&crc) != 0) {
-        std::fprintf(stderr, "cannot set up the monitor: control file or control block\n");
+    use_temporary_data_dir();
+    if (!set_up_monitor()) {
         return 1;
     }
     std::printf("processes on this machine before the benchmark: %d\n", pids_in_proc());

@@ -1,0 +1,58 @@
+#include "support/monitor_setup.h"
+
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <iterator>
+#include <sched.h>
+#include <string>
+
+#include "core/control_block.h"
+#include "core/control_file.h"
+#include "core/settings.h"
+#include "data_blocks.h"
+
+bool enter_private_ipc() {
+    if (unshare(CLONE_NEWIPC) != 0) {
+        std::fprintf(stderr, "an IPC namespace of its own is needed (run as root): %s\n",
+                     std::strerror(errno));
+        return false;
+    }
+    return true;
+}
+
+void use_temporary_data_dir() {
+    static char data_dir[] = "/tmp/tarn-bench-XXXXXX";
+    if (std::getenv("TELV_DATA_DIR") == nullptr && mkdtemp(data_dir) != nullptr) {
+        setenv("TELV_DATA_DIR", data_dir, 1);
+    }
+}
+
+bool load_example_control_file() {
+    std::ifstream in(std::string(TARN_SOURCE_DIR) + "/examples/telvzopt.trm", std::ios::binary);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    if (text.empty()) {
+        return false;
+    }
+    settings_start_values();
+    uint32_t crc = 0;
+    tarn_parse_control_file(text.c_str(), &crc);
+    return true;
+}
+
+bool set_up_monitor() {
+    uint32_t crc = 0;
+    if (!load_example_control_file() || tarn_init(&crc) != 0) {
+        std::fprintf(stderr, "cannot set up the monitor: control file or control block\n");
+        return false;
+    }
+    return true;
+}
+
+void start_pass() {
+    clear_primary_data_block();
+    outbufferleft = OUTBUFFER_BUDGET;
+    pdboverflow = 0;
+}
