@@ -17,7 +17,7 @@ extern int32_t minimum_java_free_space;         // percent (x10) of Java heap th
 extern int32_t checking_interval;               // seconds between passes
 extern int32_t snapshot_interval;               // passes between plain snapshots, 0 = none
 extern int32_t trend_analysis_points;           // samples kept for the trend analysis, at most 24
-extern int32_t trend_analysis_num_increases;    // rises in a row that make a trend
+extern int32_t trend_analysis_num_increases;    // rises over the samples that make a leak
 extern uint32_t max_snapshot_file_size;         // bytes the snapshot file may grow to, 0 = unset
 extern int32_t low_free_size;                   // KB of LowFree below which memory is short
 extern int32_t min_swap_size;                   // KB of swap the host must have
