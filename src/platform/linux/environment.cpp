@@ -58,12 +58,20 @@ std::string data_directory(int *error) {
     return directory;
 }
 
-std::string file_in_data_directory(const char *variable, const char *default_name) {
+std::string path_of_file(const char *variable, const char *default_name, bool *in_data_directory) {
     const char *value = std::getenv(variable);
-    if (value != nullptr && value[0] != '\0') {
-        return value;
+    *in_data_directory = value == nullptr || value[0] == '\0';
+    return *in_data_directory ? text(DATA_DIR_VARIABLE, DEFAULT_DATA_DIR) + "/" + default_name
+                              : value;
+}
+
+std::string file_in_data_directory(const char *variable, const char *default_name) {
+    bool in_data_directory = false;
+    std::string path = path_of_file(variable, default_name, &in_data_directory);
+    if (in_data_directory) {
+        data_directory();
     }
-    return data_directory() + "/" + default_name;
+    return path;
 }
 
 } // namespace telv::environment

@@ -25,5 +25,8 @@ std::string data_directory(int *error = nullptr);
 
 // The file named by `variable`, or `default_name` inside the data directory when it is unset.
 std::string file_in_data_directory(const char *variable, const char *default_name);
+// The same path, without making the data directory: true in *in_data_directory when the path is
+// the default one inside it, which data_directory() must make before the file is opened.
+std::string path_of_file(const char *variable, const char *default_name, bool *in_data_directory);
 
 } // namespace telv::environment

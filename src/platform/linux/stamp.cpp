@@ -19,8 +19,15 @@ UtcTime utc_now() {
     return now;
 }
 
-long thread_id() {
-    return ::syscall(SYS_gettid);
+long thread_id(pid_t pid) {
+    // A thread keeps its id for life; only a forked child, whose pid differs, asks again.
+    thread_local pid_t asked_in = 0;
+    thread_local long id = 0;
+    if (asked_in != pid) {
+        id = ::syscall(SYS_gettid);
+        asked_in = pid;
+    }
+    return id;
 }
 
 } // namespace telv::stamp

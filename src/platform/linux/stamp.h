@@ -1,6 +1,8 @@
 // What every line the platform writes begins with: the time in UTC and who wrote it.
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 
 namespace telv::stamp {
@@ -11,7 +13,8 @@ struct UtcTime {
 };
 UtcTime utc_now();
 
-// The kernel's id of the calling thread (the one `ps -L` and /proc/<pid>/task show).
-long thread_id();
+// The kernel's id of the calling thread (the one `ps -L` and /proc/<pid>/task show), for a
+// caller whose process id is `pid` (the caller has just read it).
+long thread_id(pid_t pid);
 
 } // namespace telv::stamp

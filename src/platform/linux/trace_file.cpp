@@ -116,14 +116,20 @@ Reach reach(const std::string &path, const struct stat &open_file) {
 
 struct Target {
     std::string path;
+    bool in_data_directory; // the data directory is made before the file is opened
     uint64_t max_bytes;
     bool detail;
 };
 
+// Read anew for every line, so that a change of the environment takes effect at once; the data
+// directory is made only when the file is opened, not for every line.
 Target current_target() {
-    return Target{environment::file_in_data_directory(FILE_VARIABLE, DEFAULT_FILE_NAME),
-                  environment::number(MAX_BYTES_VARIABLE, DEFAULT_MAX_BYTES),
-                  environment::text(DETAIL_VARIABLE, "1") != "0"};
+    Target target;
+    target.path =
+        environment::path_of_file(FILE_VARIABLE, DEFAULT_FILE_NAME, &target.in_data_directory);
+    target.max_bytes = environment::number(MAX_BYTES_VARIABLE, DEFAULT_MAX_BYTES);
+    target.detail = environment::text(DETAIL_VARIABLE, "1") != "0";
+    return target;
 }
 
 // What became of a line in one round under the file's lock.
@@ -161,12 +167,17 @@ Round append_once(const Sink &s, const Target &target, const char *line, size_t 
 // and the line goes to the new file. Each such round follows a rename, here or elsewhere, so the
 // loop moves on; a rename that moves nothing (the path opens the same file again) fails, and so
 // does every failing open, lock or write.
-Round append(Sink &s, const Target &target, const char *line, size_t length) {
+Round append(Sink &s, const Target &target, pid_t pid, const char *line, size_t length) {
     Round round = Round::rotated;
     for (bool renamed = false; round == Round::rotated; renamed = true) {
-        bool stale = s.fd < 0 || s.path != target.path || s.owner != ::getpid();
-        if ((stale || renamed) && !open_sink(s, target.path, renamed)) {
-            return Round::failed;
+        bool stale = s.fd < 0 || s.path != target.path || s.owner != pid;
+        if (stale || renamed) {
+            if (target.in_data_directory) {
+                environment::data_directory();
+            }
+            if (!open_sink(s, target.path, renamed)) {
+                return Round::failed;
+            }
         }
         round = append_once(s, target, line, length);
     }
@@ -181,13 +192,14 @@ std::string_view printed(const char *buffer, size_t size, int length) {
 
 // Stamps, composes and appends one line; the caller holds the sink's lock.
 bool emit(Sink &s, const Target &target, std::string_view text) {
+    pid_t pid = ::getpid();
     char stamp[128];
     int stamp_length = std::snprintf(stamp, sizeof stamp, "%s %ld %ld ", stamp::utc_now().text,
-                                     static_cast<long>(::getpid()), stamp::thread_id());
+                                     static_cast<long>(pid), stamp::thread_id(pid));
     char line[MAX_LINE];
     size_t room = static_cast<size_t>(std::min<uint64_t>(sizeof line, target.max_bytes));
     size_t length = compose(line, room, printed(stamp, sizeof stamp, stamp_length), text);
-    Round round = append(s, target, line, length);
+    Round round = append(s, target, pid, line, length);
     // A reader who finds the file past its bound learns why, once. The note is a line past the
     // bound too, but by then the path has been said.
     if (round == Round::written_past_bound && s.said_unrotated.insert(target.path).second) {
