@@ -1,0 +1,2 @@
+# The storage checks over the recording platform, with fake appliance programs first on PATH.
+tarn_library_test(file_listing_test file_listing_test.cpp support/fake_commands.cpp)
