@@ -88,10 +88,6 @@ void spawn_one_child(benchmark::State &state) {
 } // namespace
 
 int main(int argc, char **argv) {
-    if (!enter_private_ipc()) {
-        return 1;
-    }
-    use_temporary_data_dir();
     if (!set_up_monitor()) {
         return 1;
     }

@@ -93,10 +93,6 @@ extern "C" int tracesvc_trace(const char *format, ...) {
 }
 
 int main(int argc, char **argv) {
-    if (!enter_private_ipc()) {
-        return 1;
-    }
-    use_temporary_data_dir();
     if (!set_up_monitor()) {
         return 1;
     }

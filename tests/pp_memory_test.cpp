@@ -25,6 +25,7 @@
 #include "core/settings.h"
 #include "data_blocks.h"
 #include "fake_commands.h"
+#include "matcher_log.h"
 #include "memory/name_matching.h"
 #include "memory/pp_memory.h"
 #include "private_ipc.h"
@@ -263,33 +264,6 @@ std::vector<row_values> process_rows(const tarn_control_block &block) {
     const auto *rest = reinterpret_cast<const char *>(block.process_table + i);
     EXPECT_TRUE(all_zero(rest, sizeof(process_row) * static_cast<size_t>(PROCESS_TABLE_ROWS - i)));
     return rows;
-}
-
-// ---- The test seam of the name matcher ----
-
-struct matcher_call {
-    const regex_t *expression;
-    std::string name;
-    size_t nmatch;
-    bool operator==(const matcher_call &) const = default;
-};
-
-void PrintTo(const matcher_call &call, std::ostream *out) {
-    *out << "{" << static_cast<const void *>(call.expression) << ", \"" << call.name
-         << "\", nmatch " << call.nmatch << "}";
-}
-
-std::vector<matcher_call> matcher_calls;
-
-// Records what it is asked and writes every match slot the caller says it has, so that under
-// AddressSanitizer a match array smaller than nmatch fails here; then matches as regexec does.
-int recording_matcher(const regex_t *expression, const char *name, size_t nmatch, regmatch_t *found,
-                      int flags) {
-    matcher_calls.push_back({expression, name, nmatch});
-    for (size_t i = 0; i < nmatch; ++i) {
-        found[i] = regmatch_t{-2, -2};
-    }
-    return regexec(expression, name, nmatch, found, flags);
 }
 
 // ---- The fixture ----

@@ -19,6 +19,7 @@
 #include "core/settings.h"
 #include "data_blocks.h"
 #include "logsvc.h"
+#include "matcher_log.h"
 #include "memory/name_matching.h"
 #include "memory/trend_analysis.h"
 #include "private_ipc.h"
@@ -296,29 +297,6 @@ void expect_same_lines(const lines &actual, const lines &expected) {
         }
     }
     EXPECT_EQ(actual.size(), expected.size());
-}
-
-// ---- The test seam of the name matcher ----
-
-struct matcher_call {
-    const regex_t *expression;
-    std::string name;
-    size_t nmatch;
-    std::string top; // topDataBlock when the name was matched
-};
-
-std::vector<matcher_call> matcher_calls;
-
-// Records what it is asked (and what topDataBlock holds at that moment), writes every match slot
-// the caller says it has, so that under AddressSanitizer a match array smaller than nmatch fails
-// here; then matches as regexec does.
-int recording_matcher(const regex_t *expression, const char *name, size_t nmatch, regmatch_t *found,
-                      int flags) {
-    matcher_calls.push_back({expression, name, nmatch, top_block()});
-    for (size_t i = 0; i < nmatch; ++i) {
-        found[i] = regmatch_t{-2, -2};
-    }
-    return regexec(expression, name, nmatch, found, flags);
 }
 
 // ---- The fixture ----

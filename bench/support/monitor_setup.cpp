@@ -43,6 +43,10 @@ bool load_example_control_file() {
 }
 
 bool set_up_monitor() {
+    if (!enter_private_ipc()) {
+        return false;
+    }
+    use_temporary_data_dir();
     uint32_t crc = 0;
     if (!load_example_control_file() || tarn_init(&crc) != 0) {
         std::fprintf(stderr, "cannot set up the monitor: control file or control block\n");

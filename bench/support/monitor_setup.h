@@ -13,8 +13,9 @@ void use_temporary_data_dir();
 // The settings and tables of the example control file, as the monitor reads them at start.
 bool load_example_control_file();
 
-// The settings and tables of the example control file, then the control block; says what failed
-// on standard error.
+// The monitor of a benchmark: a private IPC namespace, a temporary data directory, the settings
+// and tables of the example control file, then the control block; says what failed on standard
+// error.
 bool set_up_monitor();
 
 // What the loop does to primaryDataBlock before the checks of a pass.
