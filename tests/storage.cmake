@@ -1,2 +1,3 @@
 # The storage checks over the recording platform, with fake appliance programs first on PATH.
 tarn_library_test(file_listing_test file_listing_test.cpp support/fake_commands.cpp)
+tarn_library_test(file_system_test file_system_test.cpp support/fake_commands.cpp)

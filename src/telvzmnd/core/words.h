@@ -19,3 +19,9 @@ int split_words(const char *text, int count);
 // character; a word without digits is 0. A number beyond the 32-bit range, where atoi gives no
 // defined value, reads as the nearest end of the range, so that a huge limit stays a huge limit.
 int32_t read_number(const char *word);
+
+// A sum or product of 32-bit values, computed in 64 bits, cut back to 32 bits as two's complement
+// wraps it: the monitor's figures have always been 32-bit, and this keeps their overflow defined.
+inline int32_t wrap32(int64_t value) {
+    return static_cast<int32_t>(static_cast<uint32_t>(value));
+}

@@ -25,10 +25,6 @@ constexpr int SWAP_LINE_WORDS = 4;   // Swap: total used free
 constexpr int MEMINFO_WORDS = 3;     // name: value kB
 constexpr char LOW_FREE_NAME[] = "LowFree:";
 
-int32_t wrap32(int64_t value) {
-    return static_cast<int32_t>(static_cast<uint32_t>(value));
-}
-
 // Each command's section of primaryDataBlock begins with a line end and its header.
 void append_section_header(const char *header) {
     append_unbudgeted("\n\r");
