@@ -743,7 +743,7 @@ TEST_F(FileSystem, MissingDfIsTracedForEachRunAndTheCheckGoesOn) {
 }
 
 TEST_F(FileSystem, NoPipeSkipsEachRunWithItsOwnTrace) {
-    std::string traces = fake::run_without_descriptors([this] {
+    std::string traces = fake::run_without_descriptors([] {
         uint32_t given = CRC_GIVEN;
         int32_t code = 0;
         int32_t value = 0;

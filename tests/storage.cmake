@@ -1,3 +1,4 @@
 # The storage checks over the recording platform, with fake appliance programs first on PATH.
 tarn_library_test(file_listing_test file_listing_test.cpp support/fake_commands.cpp)
 tarn_library_test(file_system_test file_system_test.cpp support/fake_commands.cpp)
+tarn_library_test(open_files_test open_files_test.cpp support/fake_commands.cpp)

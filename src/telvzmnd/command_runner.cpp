@@ -85,12 +85,20 @@ command_outcome run_command(const command_spec &command, command_line_handler ha
                        errno);
         return command_outcome::pipe_failed;
     }
+    if (command.starting_trace != nullptr) {
+        tracesvc_trace("%s", command.starting_trace);
+    }
     pid_t child = 0;
     int spawn_error = spawn_child(command, ends[1], &child);
     close(ends[1]);
     if (spawn_error != 0) {
         tracesvc_trace("TARNMNDF: rc from %s execvp call is: %d; errno=%d.", command.exec_word, -1,
                        spawn_error);
+    }
+    if (command.started_trace != nullptr) {
+        tracesvc_trace("%s", command.started_trace);
+    }
+    if (spawn_error != 0) {
         close(ends[0]);
         return command_outcome::ran;
     }

@@ -20,6 +20,11 @@ struct command_spec {
     // The words that name the command in the traces of a failure: "ps", "free", "df", "df1" ...
     const char *pipe_word;
     const char *exec_word;
+    // Trace lines that belong to the child's start, when the check has them: the first is written
+    // once the pipe is made, just before the child is started; the second right after the start,
+    // whether or not it succeeded. Neither is written when no pipe could be made.
+    const char *starting_trace = nullptr;
+    const char *started_trace = nullptr;
 };
 
 enum class command_outcome {

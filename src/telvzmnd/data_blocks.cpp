@@ -23,6 +23,9 @@ constexpr char LINE_END[] = "\n\r";
 size_t primary_length;     // strlen(primaryDataBlock), kept by every append
 size_t primary_high_water; // bytes written since the last clear, terminating NULs included
 size_t ps_high_water;      // bytes of newPSDataBlock written since its last clear
+size_t ls_length;          // strlen(lsDataBlock), kept by every append
+size_t ls_high_water;      // bytes of lsDataBlock written since its last clear
+bool ls_full;              // a line was dropped since the last clear: the rest of it goes too
 
 void append_bytes(const char *text, size_t length) {
     size_t room = PRIMARY_DATA_BLOCK_SIZE - 1 - primary_length;
@@ -39,20 +42,38 @@ void move_budget(int64_t change) {
         static_cast<int32_t>(static_cast<uint32_t>(static_cast<int64_t>(outbufferleft) + change));
 }
 
+// The room test of the output-block rule: true when a line of `length` may go in; otherwise the
+// pass's one overflow line goes in instead.
+bool budget_allows(int64_t length) {
+    if (length + 5 < outbufferleft) {
+        return true;
+    }
+    if (pdboverflow == 0) {
+        pdboverflow = 1;
+        append_bytes(OVERFLOW_LINE, sizeof OVERFLOW_LINE - 1);
+        outbufferleft = 4;
+    }
+    return false;
+}
+
 } // namespace
 
 void append_data_line(const char *text) {
     auto length = static_cast<int64_t>(std::strlen(text));
-    if (length + 5 >= outbufferleft) {
-        if (pdboverflow == 0) {
-            pdboverflow = 1;
-            append_bytes(OVERFLOW_LINE, sizeof OVERFLOW_LINE - 1);
-            outbufferleft = 4;
-        }
+    if (!budget_allows(length)) {
         return;
     }
     append_bytes(text, static_cast<size_t>(length));
     append_bytes(LINE_END, sizeof LINE_END - 1);
+    move_budget(-(length + 3));
+}
+
+void append_data_line_unended(const char *text) {
+    auto length = static_cast<int64_t>(std::strlen(text));
+    if (!budget_allows(length)) {
+        return;
+    }
+    append_bytes(text, static_cast<size_t>(length));
     move_budget(-(length + 3));
 }
 
@@ -86,4 +107,29 @@ void copy_to_ps_data_block(const char *from) {
 void clear_ps_data_block() {
     std::memset(newPSDataBlock, 0, ps_high_water);
     ps_high_water = 0;
+}
+
+void append_ls_line(const char *text) {
+    size_t length = std::strlen(text);
+    size_t room = LS_DATA_BLOCK_SIZE - 1 - ls_length;
+    ls_full = ls_full || length > room || room - length < sizeof LINE_END - 1;
+    if (ls_full) {
+        return;
+    }
+    std::memcpy(lsDataBlock + ls_length, text, length);
+    std::memcpy(lsDataBlock + ls_length + length, LINE_END, sizeof LINE_END - 1);
+    ls_length += length + sizeof LINE_END - 1;
+    lsDataBlock[ls_length] = '\0';
+    ls_high_water = std::max(ls_high_water, ls_length + 1);
+}
+
+size_t ls_data_length() {
+    return ls_length;
+}
+
+void clear_ls_data_block() {
+    std::memset(lsDataBlock, 0, ls_high_water);
+    ls_length = 0;
+    ls_high_water = 0;
+    ls_full = false;
 }

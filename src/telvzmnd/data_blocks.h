@@ -36,6 +36,9 @@ extern char file_buffer[FILE_BUFFER_SIZE];        // snapshot text staged for th
 // below outbufferleft, which then drops by length + 3; otherwise, once a pass (pdboverflow), the
 // line "No room to output more lines... \n\r" goes in and outbufferleft becomes 4.
 void append_data_line(const char *text);
+// The same room test and overflow line, and the same cost of length + 3, for a line that goes in
+// without its line end: a descriptor directory's header, which the count of its descriptors ends.
+void append_data_line_unended(const char *text);
 // A section header goes in (as far as the block holds it), and its length is added to outbufferleft
 // (added: that has always been the rule for headers).
 void append_header_line(const char *text);
@@ -51,3 +54,13 @@ void clear_primary_data_block();
 void copy_to_ps_data_block(const char *from);
 // Empties newPSDataBlock, clearing only as far as anything was written since the last clear.
 void clear_ps_data_block();
+
+// lsDataBlock holds the listing of one descriptor directory at a time. A line goes in with its
+// "\n\r" only when the whole of it fits before the block's terminating NUL; the first line that
+// does not fit, and every line after it until the next clear, is dropped, so that a listing too
+// long for the block keeps its beginning in whole lines.
+void append_ls_line(const char *text);
+// The length of the text in lsDataBlock.
+size_t ls_data_length();
+// Empties lsDataBlock, clearing only as far as anything was written since the last clear.
+void clear_ls_data_block();
