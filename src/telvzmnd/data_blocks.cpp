@@ -83,6 +83,11 @@ void append_header_line(const char *text) {
     move_budget(static_cast<int64_t>(length));
 }
 
+void append_section_header(const char *header) {
+    append_unbudgeted(LINE_END);
+    append_header_line(header);
+}
+
 void append_unbudgeted(const char *text) {
     append_bytes(text, std::strlen(text));
 }

@@ -42,6 +42,8 @@ void append_data_line_unended(const char *text);
 // A section header goes in (as far as the block holds it), and its length is added to outbufferleft
 // (added: that has always been the rule for headers).
 void append_header_line(const char *text);
+// A command's section: a line end, then its header by the header rule.
+void append_section_header(const char *header);
 // Text that goes in without regard to outbufferleft.
 void append_unbudgeted(const char *text);
 // The length of the text in primaryDataBlock.

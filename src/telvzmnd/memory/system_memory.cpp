@@ -25,12 +25,6 @@ constexpr int SWAP_LINE_WORDS = 4;   // Swap: total used free
 constexpr int MEMINFO_WORDS = 3;     // name: value kB
 constexpr char LOW_FREE_NAME[] = "LowFree:";
 
-// Each command's section of primaryDataBlock begins with a line end and its header.
-void append_section_header(const char *header) {
-    append_unbudgeted("\n\r");
-    append_header_line(header);
-}
-
 void trace_figures(const free_figures &figures, int32_t in_use) {
     tracesvc_trace("TARNMNDD: memtotal       is %d (dec)", figures.memtotal);
     tracesvc_trace("TARNMNDD: memused        is %d (dec)", figures.memused);

@@ -198,8 +198,7 @@ void judge_other(const file_system_pass &pass, df_pass kind, const char *mount_p
 
 void run_df(const file_system_pass &pass, df_pass kind) {
     const df_layout &layout = layout_of(kind);
-    append_unbudgeted("\n\r");
-    append_header_line(layout.header);
+    append_section_header(layout.header);
     run_command(layout.command, [&pass, kind](char *text, size_t) { df_line(pass, kind, text); });
 }
 

@@ -31,12 +31,6 @@ constexpr char DIRECTORY_PREFIX[] = "/proc"; // "/proc/<pid>/fd:" begins a direc
 // has one, whatever the script prints around the descriptors.
 constexpr int32_t SUMMARY_LINES_LEFT_OUT = 5;
 
-// Each command's section of primaryDataBlock begins with a line end and its header.
-void append_section_header(const char *header) {
-    append_unbudgeted("\n\r");
-    append_header_line(header);
-}
-
 int32_t clamped32(int64_t value) {
     return static_cast<int32_t>(std::clamp<int64_t>(value, INT32_MIN, INT32_MAX));
 }
