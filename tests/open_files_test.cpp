@@ -4,11 +4,13 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <unistd.h>
 #include <vector>
 
 #include "command_runner.h"
@@ -1044,6 +1046,54 @@ TEST_F(OpenFiles, HostsOwnFileNrGivesItsMaximum) {
     EXPECT_EQ(rec::traces_starting("TARNMNDD: maximum open file descriptors = "),
               lines{"TARNMNDD: maximum open file descriptors = " + dec(expected) + " (dec)"});
     EXPECT_EQ(rec::traces_starting("TARNMNDD: total allocated file descriptors = ").size(), 1u);
+}
+
+// ---- The host's own file-nr and the project's own runAsRoot and lsmon.sh ----
+
+// PATH with the build's appliance programs first and no fakes: the check as a host runs it.
+class RealOpenFiles : public OpenFiles {
+  protected:
+    void SetUp() override {
+        OpenFiles::SetUp();
+        const char *path = std::getenv("PATH");
+        saved_path = path != nullptr ? path : "";
+        setenv("PATH", (std::string(TELV_LIBEXEC_DIR) + ":/usr/bin:/bin").c_str(), 1);
+    }
+    void TearDown() override {
+        setenv("PATH", saved_path.c_str(), 1);
+        OpenFiles::TearDown();
+    }
+    std::string saved_path;
+};
+
+TEST_F(RealOpenFiles, GenerousThresholdsFindNothingAndEveryProcessHasItsSummaryLine) {
+    file_descriptors_percent_threshold = 1000;
+    EXPECT_EQ(check(), 0u);
+    expect_finding(0, 0);
+    const std::string text = block_text();
+    // This test process holds descriptors 0 to 2 at least: its header and a summary number.
+    const std::string own = "/proc/" + std::to_string(getpid()) + "/fd: ";
+    EXPECT_NE(text.find(own), std::string::npos) << text.substr(0, 2000);
+    EXPECT_NE(rec::find_trace(ABOUT_TO_PROCESS), -1);
+    EXPECT_EQ(rec::traces_starting("TARNMNDF: rc from").size(), 0u);
+}
+
+TEST_F(RealOpenFiles, ALowPerProcessThresholdReportsTheFirstProcessWithItsListing) {
+    pp_file_descriptors_threshold = 2;
+    EXPECT_EQ(check(), 0u);
+    EXPECT_EQ(takeLogCrc, PROCESS_DESCRIPTORS);
+    EXPECT_GT(takeLogValue, 2);
+    // The first directory of the listing is the reported one: its listing follows the summary
+    // lines in the pass's data, and the error text quotes the header of the next directory.
+    const std::string text = block_text();
+    const size_t attached = text.find("\n\r/proc/");
+    ASSERT_NE(attached, std::string::npos);
+    EXPECT_NE(text.find("fd:\n\rtotal ", attached), std::string::npos);
+    EXPECT_EQ(std::string(topDataBlock)
+                  .rfind("\n\rError Information: \n\rtoo many open files in "
+                         "process\n\rEntire line was: \n\r/proc/",
+                         0),
+              0u);
 }
 
 // ---- The arithmetic ----
