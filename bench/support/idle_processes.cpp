@@ -5,12 +5,27 @@
 #include <cstdlib>
 #include <cstring>
 #include <dirent.h>
+#include <fcntl.h>
 #include <spawn.h>
 #include <sys/wait.h>
 
 extern char **environ;
 
-void idle_processes::resize(size_t count) {
+namespace {
+
+// Descriptors 3 to `descriptors` - 1 of a child opened on /dev/null.
+posix_spawn_file_actions_t *descriptor_actions(posix_spawn_file_actions_t *actions,
+                                               int descriptors) {
+    posix_spawn_file_actions_init(actions);
+    for (int fd = 3; fd < descriptors; ++fd) {
+        posix_spawn_file_actions_addopen(actions, fd, "/dev/null", O_RDONLY, 0);
+    }
+    return actions;
+}
+
+} // namespace
+
+void idle_processes::resize(size_t count, int descriptors) {
     while (pids_.size() > count) {
         pid_t pid = pids_.back();
         pids_.pop_back();
@@ -18,16 +33,19 @@ void idle_processes::resize(size_t count) {
         waitpid(pid, nullptr, 0);
     }
     const char *argv[] = {"sleep", "1000", nullptr};
+    posix_spawn_file_actions_t actions;
+    descriptor_actions(&actions, descriptors);
     while (pids_.size() < count) {
         pid_t pid = 0;
         int error =
-            posix_spawn(&pid, "/bin/sleep", nullptr, nullptr, const_cast<char **>(argv), environ);
+            posix_spawn(&pid, "/bin/sleep", &actions, nullptr, const_cast<char **>(argv), environ);
         if (error != 0) {
             std::fprintf(stderr, "posix_spawn /bin/sleep: %s\n", std::strerror(error));
             std::exit(1);
         }
         pids_.push_back(pid);
     }
+    posix_spawn_file_actions_destroy(&actions);
 }
 
 int pids_in_proc() {

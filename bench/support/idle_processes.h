@@ -13,7 +13,9 @@ class idle_processes {
     idle_processes(const idle_processes &) = delete;
     idle_processes &operator=(const idle_processes &) = delete;
 
-    void resize(size_t count);
+    // Starts or ends children until `count` are running; each new child holds `descriptors` open
+    // descriptors (its standard three, then /dev/null up to that count).
+    void resize(size_t count, int descriptors = 3);
 
   private:
     std::vector<pid_t> pids_;
