@@ -5,6 +5,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <fcntl.h>
+#include <filesystem>
+#include <functional>
 #include <map>
 #include <numeric>
 #include <string>
@@ -198,6 +200,37 @@ LineNumbers all_lines(const Writers &writers) {
     return all;
 }
 
+// Runs `body` in a forked child; whether it returned true there and the child ended normally.
+bool in_child(const std::function<bool()> &body) {
+    pid_t child = ::fork();
+    if (child == 0) {
+        ::_exit(body() ? 0 : 1);
+    }
+    int status = 0;
+    return child > 0 && ::waitpid(child, &status, 0) == child && WIFEXITED(status) &&
+           WEXITSTATUS(status) == 0;
+}
+
+// The descriptor of this process open on `path`; -1 unless there is exactly one.
+int descriptor_open_on(const std::string &path) {
+    int found = -1;
+    int count = 0;
+    for (const auto &entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+        std::error_code error;
+        if (std::filesystem::read_symlink(entry.path(), error) == path) {
+            found = std::stoi(entry.path().filename());
+            ++count;
+        }
+    }
+    return count == 1 ? found : -1;
+}
+
+// `text` made `width` characters long with trailing dots.
+std::string padded(std::string text, size_t width) {
+    text.resize(width, '.');
+    return text;
+}
+
 using PlatformTrace = platform_test::PlatformTest;
 
 TEST_F(PlatformTrace, ALineCarriesTimePidAndThread) {
@@ -325,11 +358,18 @@ TEST_F(PlatformTrace, ABoundThatIsNoNumberGivesTheDefault) {
     EXPECT_FALSE(platform_test::exists(trace_path() + ".1"));
 }
 
+// A line looks at the path only every thousand lines (or a tenth of a second): until then the
+// lines go with the removed file, and the first line that finds it missing begins a new one.
 TEST_F(PlatformTrace, ALostTraceFileIsBegunAgain) {
+    constexpr int LOOK_EVERY_LINES = 1000;
     tracesvc_trace("TARNLOSF: before");
     ASSERT_EQ(::unlink(trace_path().c_str()), 0);
-    tracesvc_trace("TARNLOSF: after");
-    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNLOSF: after"});
+    int after = 0;
+    while (after < LOOK_EVERY_LINES && !platform_test::exists(trace_path())) {
+        tracesvc_trace("TARNLOSF: after %d", after++);
+    }
+    EXPECT_EQ(texts(trace_path()),
+              std::vector<std::string>{"TARNLOSF: after " + std::to_string(after - 1)});
 }
 
 TEST_F(PlatformTrace, AnUnwritableTraceFileGivesMinusOne) {
@@ -504,6 +544,190 @@ TEST_F(PlatformTrace, ARotationThatMovesNothingFailsInsteadOfGoingRound) {
     ASSERT_EQ(::link(trace_path().c_str(), (trace_path() + ".1").c_str()), 0);
     EXPECT_EQ(tracesvc_trace("TARNHLKF: the second line, which takes the file past its bound"), -1);
     EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNHLKF: first"});
+}
+
+// A line of ours after another process rotated the file goes to the new file, never to the one
+// renamed away. Lines: A is 160 to 172 bytes, B and C 60 to 72 (the stamp holds 29 to 41).
+TEST_F(PlatformTrace, AFileRotatedByAnotherProcessIsLeftAtTheNextLine) {
+    set_variable("TELV_TRACE_MAX_BYTES", "200");
+    const std::string a = padded("TARNROTF: A ", 130);
+    const std::string b = padded("TARNROTF: B ", 30);
+    const std::string c = padded("TARNROTF: C ", 30);
+    ASSERT_GT(tracesvc_trace("%s", a.c_str()), 0);
+    ASSERT_TRUE(in_child([&] { return tracesvc_trace("%s", b.c_str()) > 0; }));
+    ASSERT_GT(tracesvc_trace("%s", c.c_str()), 0);
+    EXPECT_EQ(texts(trace_path() + ".1"), std::vector<std::string>{a});
+    EXPECT_EQ(texts(trace_path()), (std::vector<std::string>{b, c}));
+}
+
+// The size that decides a rotation counts the lines of every process: 60 to 72 bytes for P1, Q1
+// and Q2, 130 to 142 for P2, so P2 would take the file past 300 bytes and begins a new one.
+TEST_F(PlatformTrace, TheBoundCountsTheLinesOfOtherProcesses) {
+    set_variable("TELV_TRACE_MAX_BYTES", "300");
+    const std::string p1 = padded("TARNBNDF: P1 ", 30);
+    const std::string q1 = padded("TARNBNDF: Q1 ", 30);
+    const std::string q2 = padded("TARNBNDF: Q2 ", 30);
+    const std::string p2 = padded("TARNBNDF: P2 ", 100);
+    ASSERT_GT(tracesvc_trace("%s", p1.c_str()), 0);
+    ASSERT_TRUE(in_child([&] {
+        return tracesvc_trace("%s", q1.c_str()) > 0 && tracesvc_trace("%s", q2.c_str()) > 0;
+    }));
+    ASSERT_GT(tracesvc_trace("%s", p2.c_str()), 0);
+    EXPECT_EQ(texts(trace_path() + ".1"), (std::vector<std::string>{p1, q1, q2}));
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{p2});
+}
+
+TEST_F(PlatformTrace, AChangedFileOrDataDirectoryIsUsedFromTheNextLine) {
+    const std::string a = dir + "/a.trace";
+    const std::string b = dir + "/b.trace";
+    const std::string other = dir + "/other";
+    set_variable("TELV_TRACE_FILE", a);
+    tracesvc_trace("TARNENVF: 1");
+    set_variable("TELV_TRACE_FILE", b);
+    tracesvc_trace("TARNENVF: 2");
+    set_variable("TELV_TRACE_FILE", a);
+    tracesvc_trace("TARNENVF: 3");
+    ::unsetenv("TELV_TRACE_FILE");
+    tracesvc_trace("TARNENVF: 4");
+    set_variable("TELV_DATA_DIR", other);
+    tracesvc_trace("TARNENVF: 5");
+    set_variable("TELV_DATA_DIR", dir);
+    set_variable("TELV_TRACE_FILE", "");
+    tracesvc_trace("TARNENVF: 6");
+    EXPECT_EQ(texts(a), (std::vector<std::string>{"TARNENVF: 1", "TARNENVF: 3"}));
+    EXPECT_EQ(texts(b), std::vector<std::string>{"TARNENVF: 2"});
+    EXPECT_EQ(texts(trace_path()), (std::vector<std::string>{"TARNENVF: 4", "TARNENVF: 6"}));
+    EXPECT_EQ(texts(other + "/telvzmnd.trace"), std::vector<std::string>{"TARNENVF: 5"});
+}
+
+TEST_F(PlatformTrace, AChangedBoundIsKeptFromTheNextLine) {
+    const std::string first = padded("TARNBNDF: first ", 60);
+    const std::string second = padded("TARNBNDF: second ", 60);
+    tracesvc_trace("%s", first.c_str());
+    set_variable("TELV_TRACE_MAX_BYTES", "150");
+    tracesvc_trace("%s", second.c_str());
+    EXPECT_EQ(texts(trace_path() + ".1"), std::vector<std::string>{first});
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{second});
+}
+
+// However the environment changes between two lines (a value replaced or changed in place, a
+// variable removed and another added in its stead), the second line follows it. A dropped line
+// still answers the length of its text.
+TEST_F(PlatformTrace, DetailSwitchedBetweenTwoLinesIsFollowedAtTheSecond) {
+    static char entry[] = "TELV_TRACE_DETAIL=0";
+    std::snprintf(entry, sizeof entry, "TELV_TRACE_DETAIL=0");
+    set_variable("TELV_TRACE_DETAIL", "0");
+    EXPECT_EQ(tracesvc_trace("TARNSWTD: dropped %d", 1), 19);
+    set_variable("TELV_TRACE_DETAIL", "1");
+    tracesvc_trace("TARNSWTD: kept %d", 2);
+    set_variable("TELV_TRACE_DETAIL", "0");
+    EXPECT_EQ(tracesvc_trace("TARN%sD: dropped by its text %d", "SWT", 3), 31);
+    ::unsetenv("TELV_TRACE_DETAIL");
+    tracesvc_trace("TARNSWTD: kept %d", 4);
+    set_variable("TELV_TRACE_DETAIL", "");
+    tracesvc_trace("TARNSWTD: kept %d", 5);
+    ASSERT_EQ(::putenv(entry), 0);
+    tracesvc_trace("TARNSWTD: dropped %d", 6);
+    entry[sizeof entry - 2] = '1';
+    tracesvc_trace("TARNSWTD: kept %d", 7);
+    ::unsetenv("TELV_TRACE_DETAIL");
+    set_variable("TELV_TRACE_TEST_FILLER", "x");
+    tracesvc_trace("TARNSWTD: kept %d", 8);
+    ::unsetenv("TELV_TRACE_TEST_FILLER");
+    set_variable("TELV_TRACE_DETAIL", "0");
+    tracesvc_trace("TARNSWTD: dropped %d", 9);
+    tracesvc_trace("TARNSWTF: flow %d", 10);
+    ::unsetenv("TELV_TRACE_DETAIL");
+    std::vector<std::string> expected = {"TARNSWTD: kept 2", "TARNSWTD: kept 4",
+                                         "TARNSWTD: kept 5", "TARNSWTD: kept 7",
+                                         "TARNSWTD: kept 8", "TARNSWTF: flow 10"};
+    EXPECT_EQ(texts(trace_path()), expected);
+}
+
+// A forked child writes with its own pid and thread, through a description of the file that it
+// opened itself: its line leaves the parent's offset where the parent's last line left it.
+TEST_F(PlatformTrace, AForkedChildWritesThroughADescriptionOfItsOwn) {
+    ASSERT_GT(tracesvc_trace("TARNFRKF: parent"), 0);
+    int parents = descriptor_open_on(trace_path());
+    ASSERT_GE(parents, 0);
+    off_t offset = ::lseek(parents, 0, SEEK_CUR);
+    ASSERT_EQ(offset, file_size(trace_path()));
+    pid_t child = 0;
+    int report[2];
+    ASSERT_EQ(::pipe(report), 0);
+    ASSERT_TRUE(in_child([&] {
+        pid_t own = ::getpid();
+        return tracesvc_trace("TARNFRKF: child") > 0 &&
+               ::write(report[1], &own, sizeof own) == sizeof own;
+    }));
+    ASSERT_EQ(::read(report[0], &child, sizeof child), static_cast<ssize_t>(sizeof child));
+    ::close(report[0]);
+    ::close(report[1]);
+    EXPECT_EQ(::lseek(parents, 0, SEEK_CUR), offset);
+    EXPECT_GT(file_size(trace_path()), offset);
+    ASSERT_GT(tracesvc_trace("TARNFRKF: parent again"), 0);
+    std::vector<std::string> lines = read_lines(trace_path());
+    ASSERT_EQ(lines.size(), 3u);
+    std::vector<TraceLine> parsed(3);
+    for (size_t i = 0; i < 3; ++i) {
+        ASSERT_TRUE(parse(lines[i], &parsed[i])) << lines[i];
+    }
+    EXPECT_EQ(parsed[0].pid, ::getpid());
+    EXPECT_EQ(parsed[1].text, "TARNFRKF: child");
+    EXPECT_EQ(parsed[1].pid, child);
+    EXPECT_EQ(parsed[1].thread, child); // the child's only thread
+    EXPECT_EQ(parsed[2].pid, ::getpid());
+    EXPECT_EQ(parsed[2].thread, platform_test::own_thread_id());
+}
+
+// While another thread writes lines, a child forked meanwhile can write its own: it never finds
+// the platform's lock taken by a thread that it does not have.
+TEST_F(PlatformTrace, AChildForkedWhileAnotherThreadTracesWritesItsLine) {
+    constexpr int CHILDREN = 20;
+    std::atomic<bool> stop = false;
+    std::thread writer([&] {
+        for (int i = 0; !stop; ++i) {
+            tracesvc_trace("TARNFRKF: thread line %d", i);
+        }
+    });
+    int written = 0;
+    for (int i = 0; i < CHILDREN; ++i) {
+        written += in_child([i] { return tracesvc_trace("TARNFRKF: child %d", i) > 0; }) ? 1 : 0;
+    }
+    stop = true;
+    writer.join();
+    EXPECT_EQ(written, CHILDREN);
+    std::vector<std::string> found = texts(trace_path());
+    for (int i = 0; i < CHILDREN; ++i) {
+        EXPECT_EQ(std::count(found.begin(), found.end(), "TARNFRKF: child " + std::to_string(i)),
+                  1);
+    }
+}
+
+// Many threads rotating one file among them: every line whole, every file within the bound, and
+// each thread's lines in the order written.
+TEST_F(PlatformTrace, ThreadsRotatingTheFileKeepWholeLinesWithinTheBound) {
+    constexpr int THREADS = 8;
+    constexpr int LINES = 300;
+    set_variable("TELV_TRACE_MAX_BYTES", "3000");
+    std::vector<std::thread> writers;
+    for (int t = 0; t < THREADS; ++t) {
+        writers.emplace_back([t] {
+            for (int i = 0; i < LINES; ++i) {
+                tracesvc_trace("%s", writer_text(0, t, i).c_str());
+            }
+        });
+    }
+    for (auto &writer : writers) {
+        writer.join();
+    }
+    LineNumbers found = writer_lines(trace_path(), 3000);
+    EXPECT_FALSE(found.empty());
+    for (const auto &[writer, numbers] : found) {
+        EXPECT_TRUE(std::is_sorted(numbers.begin(), numbers.end())) << writer.second;
+        EXPECT_EQ(std::adjacent_find(numbers.begin(), numbers.end()), numbers.end());
+    }
+    EXPECT_GT(file_size(trace_path() + ".1"), 3000 - 200);
 }
 
 } // namespace

@@ -1,8 +1,12 @@
 #include "environment.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <sys/stat.h>
+
+extern char **environ;
 
 namespace telv::environment {
 
@@ -12,7 +16,10 @@ std::string text(const char *variable, const char *fallback) {
 }
 
 uint64_t number(const char *variable, uint64_t fallback) {
-    const char *value = std::getenv(variable);
+    return number_of(std::getenv(variable), fallback);
+}
+
+uint64_t number_of(const char *value, uint64_t fallback) {
     if (value == nullptr || value[0] == '\0') {
         return fallback;
     }
@@ -72,6 +79,49 @@ std::string file_in_data_directory(const char *variable, const char *default_nam
         data_directory();
     }
     return path;
+}
+
+Watch::Watch(std::span<const char *const> names) : names_(names), values_(names.size(), nullptr) {}
+
+void Watch::refresh() {
+    char **array = environ;
+    if (holds_last_look(array)) {
+        return;
+    }
+    looked_ = false; // until the look is whole: memory may run out on the way
+    entries_.clear();
+    std::fill(values_.begin(), values_.end(), nullptr);
+    for (char **entry = array; entry != nullptr && *entry != nullptr; ++entry) {
+        entries_.push_back(*entry);
+        for (size_t which = 0; which < names_.size(); ++which) {
+            size_t length = std::strlen(names_[which]);
+            // The first entry of a name holds its value, as for getenv.
+            if (values_[which] == nullptr && std::strncmp(*entry, names_[which], length) == 0 &&
+                (*entry)[length] == '=') {
+                values_[which] = *entry + length + 1;
+            }
+        }
+    }
+    entries_.push_back(nullptr);
+    array_ = array;
+    looked_ = true;
+}
+
+bool Watch::holds_last_look(char **array) const {
+    if (!looked_ || array != array_) {
+        return false;
+    }
+    if (array == nullptr) {
+        return true;
+    }
+    // Never read past the closing null: the same address may hold a shorter array by now, as the
+    // C library reallocates the array while it changes.
+    const char *const *seen = entries_.data();
+    size_t at = 0;
+    while (array[at] == seen[at] && seen[at] != nullptr) {
+        ++at;
+    }
+    return array[at] == seen[at];
 }
 
 } // namespace telv::environment

@@ -3,7 +3,9 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <cstdint>
+#include <ctime>
 
 namespace telv::stamp {
 
@@ -13,8 +15,19 @@ struct UtcTime {
 };
 UtcTime utc_now();
 
+// The caller's pid: asked of the kernel once, and once more in a forked child.
+pid_t process_id();
+
 // The kernel's id of the calling thread (the one `ps -L` and /proc/<pid>/task show), for a
 // caller whose process id is `pid` (the caller has just read it).
 long thread_id(pid_t pid);
+
+// "2026-11-22T02:31:30.123Z 4321 4322 ": the time of a trace line, its pid and its thread.
+struct LineStamp {
+    char text[128];
+    size_t length;
+    struct timespec time; // the reading of the clock that the text shows
+};
+LineStamp line_stamp();
 
 } // namespace telv::stamp

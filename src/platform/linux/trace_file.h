@@ -1,6 +1,14 @@
 // The trace file of the default platform: one line per trace call, stamped with the time, the pid
 // and the thread, kept within a size bound by renaming a full file to "<name>.1" when the path is
 // that regular file's own name (a link or a device is written to, never renamed).
+//
+// Such a file is shared through ".<name>.lock" beside it, which every writer maps: its lock keeps
+// the lines and rotations of all threads and processes apart, and it holds the file's size and a
+// count of the files begun at the path, so that a line costs one write and no other system call.
+// What only the file system can tell (the file renamed or removed by someone else) is looked at
+// every LOOK_EVERY_LINES lines or LOOK_EVERY_MS milliseconds; until then the lines go with the
+// file. Any other path, or a file whose shared state cannot be had, is looked at for every line,
+// under flock. The state file is the writers' own: cut short under them, it stops them (SIGBUS).
 #pragma once
 
 #include <cstdarg>
@@ -18,6 +26,8 @@ inline constexpr const char *DETAIL_VARIABLE = "TELV_TRACE_DETAIL";
 // A line, stamp and line feed included, is cut to this many bytes.
 inline constexpr size_t MAX_LINE = 8192;
 inline constexpr size_t DUMP_BYTES_PER_ROW = 16;
+inline constexpr uint32_t LOOK_EVERY_LINES = 1000;
+inline constexpr int64_t LOOK_EVERY_MS = 100;
 
 // A detail line: its eye-catcher (the first nine characters, "TARNSDAD:") has 'D' as the eighth.
 bool is_detail(std::string_view text);
