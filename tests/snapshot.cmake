@@ -18,3 +18,6 @@ if(TARGET telvplatform)
   target_include_directories(snapshot_platform_test PRIVATE ${PROJECT_SOURCE_DIR}/src/host)
   add_dependencies(snapshot_platform_test tarnmon)
 endif()
+
+# The gathering of the appliance's trace beside the snapshots, over a fake runAsRoot.
+tarn_library_test(trace_data_test trace_data_test.cpp support/fake_commands.cpp)
