@@ -34,6 +34,7 @@ constexpr std::array SCRIPTS = {
     "rundu.sh",
     "cleanupPartition",
     "lsmon.sh",
+    "telvzstba",
 #ifdef RUN_AS_ROOT_EXTRA_SCRIPT
     // Only the tests' own build of this program has a name of theirs on the list.
     RUN_AS_ROOT_EXTRA_SCRIPT,

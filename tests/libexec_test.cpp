@@ -1,7 +1,7 @@
 // The appliance programs of libexec/, run as the monitor runs them: runAsRoot's refusals, the
 // environment, arguments and process state it gives a script, and the file capabilities it passes
 // on; rundu.sh and cleanupPartition on file systems mounted in a mount namespace of the test's
-// own; the layout of lsmon.sh's listing.
+// own; the layout of lsmon.sh's listing; the part of the trace that telvzstba copies.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -37,6 +37,7 @@ const std::string LIBEXEC = TELV_LIBEXEC_DIR;
 const std::string RUN_AS_ROOT = LIBEXEC + "/runAsRoot";
 const std::string RUNDU = LIBEXEC + "/rundu.sh";
 const std::string LSMON = LIBEXEC + "/lsmon.sh";
+const std::string STBA = LIBEXEC + "/telvzstba";
 // The tests' own builds: runAsRoot with "show-call" on its list, cleanupPartition reading the
 // policy named by TELV_CLEANUP_POLICY.
 const std::string RUN_AS_ROOT_FOR_TESTS = TELV_RUN_AS_ROOT_FOR_TESTS;
@@ -1282,6 +1283,315 @@ TEST_F(Lsmon, RunsThroughRunAsRootAsTheMonitorCallsIt) {
     lines all = lines_of(result.out);
     std::string own_header = "/proc/" + std::to_string(getpid()) + "/fd:";
     EXPECT_NE(std::find(all.begin(), all.end(), own_header), all.end());
+}
+
+// ---- telvzstba
+
+// The bound of what telvzstba copies of the trace (README: the last 1 MiB).
+constexpr size_t TRACE_DUMP_BYTES = 1048576;
+
+// A data directory holding the trace files of the default platform.
+class Telvzstba : public Scratch {
+  protected:
+    void SetUp() override {
+        Scratch::SetUp();
+        data = scratch + "/data";
+        make_directory(data);
+        trace = data + "/telvzmnd.trace";
+        previous = trace + ".1";
+        dump = data + "/telvzstba.trm";
+    }
+
+    launch in_data_directory() const {
+        launch how;
+        how.environment = {"TELV_DATA_DIR=" + data};
+        return how;
+    }
+
+    outcome stba(const std::vector<std::string> &arguments = {"all", "telvzstba.trm"}) const {
+        return run(STBA, arguments, in_data_directory());
+    }
+
+    std::string written(size_t lines_count, size_t bytes) const {
+        return "telvzstba: " + std::to_string(lines_count) + " trace lines (" +
+               std::to_string(bytes) + " bytes) written to " + data + "/telvzstba.trm\n";
+    }
+
+    std::string no_trace_note() const {
+        return "telvzstba: no trace found in " + data + "/telvzmnd.trace or " + data +
+               "/telvzmnd.trace.1\n";
+    }
+
+    std::string left_out(const std::string &name) const {
+        return "telvzstba: left out " + data + "/" + name + ": not a regular file of user " +
+               std::to_string(getuid()) + "\n";
+    }
+
+    std::string data;
+    std::string trace;
+    std::string previous;
+    std::string dump;
+};
+
+// Trace line `number` as the platform writes it, 100 bytes with its line feed.
+std::string trace_line(int number) {
+    char line[128];
+    std::snprintf(line, sizeof line, "2026-11-22T02:31:30.123Z 4321 4322 TARNMNDF: line %06d ",
+                  number);
+    std::string text = line;
+    text.resize(99, '.');
+    return text + "\n";
+}
+
+// Lines `first` to `first + count - 1`.
+std::string trace_lines(int first, int count) {
+    std::string text;
+    for (int number = first; number < first + count; ++number) {
+        text += trace_line(number);
+    }
+    return text;
+}
+
+TEST_F(Telvzstba, WritesThePredecessorThenTheCurrentTraceNewestLast) {
+    write_file(previous, trace_lines(1, 3));
+    write_file(trace, trace_lines(4, 2));
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, written(5, 500));
+    EXPECT_EQ(read_file(dump), trace_lines(1, 5));
+    EXPECT_EQ(tree_of(data), (lines{"telvzmnd.trace", "telvzmnd.trace.1", "telvzstba.trm"}));
+    struct stat status {};
+    ASSERT_EQ(stat(dump.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0640u);
+    EXPECT_EQ(status.st_uid, getuid());
+    // The trace files are read, never changed.
+    EXPECT_EQ(read_file(previous), trace_lines(1, 3));
+    EXPECT_EQ(read_file(trace), trace_lines(4, 2));
+}
+
+TEST_F(Telvzstba, TakesEitherFileAlone) {
+    write_file(trace, trace_lines(1, 2));
+    outcome current_only = stba();
+    EXPECT_EQ(current_only.status, 0);
+    EXPECT_EQ(current_only.err, "");
+    EXPECT_EQ(current_only.out, written(2, 200));
+    EXPECT_EQ(read_file(dump), trace_lines(1, 2));
+
+    ASSERT_EQ(rename(trace.c_str(), previous.c_str()), 0);
+    outcome previous_only = stba();
+    EXPECT_EQ(previous_only.status, 0);
+    EXPECT_EQ(previous_only.err, "");
+    EXPECT_EQ(previous_only.out, written(2, 200));
+    EXPECT_EQ(read_file(dump), trace_lines(1, 2));
+}
+
+TEST_F(Telvzstba, TakesAPredecessorThatIsTheCurrentFileOnlyOnce) {
+    write_file(trace, trace_lines(1, 2));
+    ASSERT_EQ(link(trace.c_str(), previous.c_str()), 0);
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, written(2, 200));
+    EXPECT_EQ(read_file(dump), trace_lines(1, 2));
+}
+
+TEST_F(Telvzstba, KeepsTheLastWholeLinesWithinTheBound) {
+    // 1,400,000 bytes of 100-byte lines: the bound begins 24 bytes into line 3,515, so it holds
+    // the 10,485 whole lines from 3,516 on.
+    write_file(previous, trace_lines(1, 8000));
+    write_file(trace, trace_lines(8001, 6000));
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, written(10485, 1048500));
+    std::string text = read_file(dump);
+    EXPECT_EQ(text.size(), 1048500u);
+    EXPECT_TRUE(text == trace_lines(3516, 10485)) << text.substr(0, 200);
+
+    // A current file larger than the bound by itself leaves its predecessor out.
+    write_file(trace, trace_lines(20001, 11000));
+    outcome current_only = stba();
+    EXPECT_EQ(current_only.status, 0);
+    EXPECT_EQ(current_only.out, written(10485, 1048500));
+    text = read_file(dump);
+    EXPECT_TRUE(text == trace_lines(20516, 10485)) << text.substr(0, 200);
+}
+
+TEST_F(Telvzstba, KeepsALineThatBeginsRightAtTheBound) {
+    // Lines of exactly the bound together, after a line that ends where the bound begins.
+    const std::string first = "2026-11-22T02:31:30.123Z 4321 4322 TARNMNDF: just outside\n";
+    std::string within = trace_lines(1, 10485);
+    within += std::string(TRACE_DUMP_BYTES - within.size() - 1, 'x') + "\n";
+    ASSERT_EQ(within.size(), TRACE_DUMP_BYTES);
+    write_file(previous, first + within.substr(0, 500000));
+    write_file(trace, within.substr(500000));
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.out, written(10486, TRACE_DUMP_BYTES));
+    EXPECT_TRUE(read_file(dump) == within);
+
+    // Two bytes more, and the first of those lines no longer fits whole: it is left out.
+    write_file(trace, within.substr(500000) + "y\n");
+    outcome longer = stba();
+    EXPECT_EQ(longer.status, 0);
+    EXPECT_EQ(longer.out, written(10486, TRACE_DUMP_BYTES - 98));
+    EXPECT_TRUE(read_file(dump) == within.substr(100) + "y\n");
+}
+
+TEST_F(Telvzstba, WithoutATraceWritesANote) {
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, "telvzstba: no trace found, a note saying so written to " + data +
+                              "/telvzstba.trm\n");
+    EXPECT_EQ(read_file(dump), no_trace_note());
+    EXPECT_EQ(tree_of(data), lines{"telvzstba.trm"});
+    struct stat status {};
+    ASSERT_EQ(stat(dump.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0640u);
+
+    // Empty trace files hold no trace either.
+    write_file(trace, "");
+    write_file(previous, "");
+    outcome empty = stba();
+    EXPECT_EQ(empty.status, 0);
+    EXPECT_EQ(empty.err, "");
+    EXPECT_EQ(read_file(dump), no_trace_note());
+}
+
+TEST_F(Telvzstba, LeavesOutATraceThatIsNoRegularFileOfItsUser) {
+    // A link to a file the running user could not read itself, and a pipe that no one writes to.
+    std::string secret = scratch + "/secret";
+    write_file(secret, "not the trace\n", 0600);
+    ASSERT_EQ(symlink(secret.c_str(), trace.c_str()), 0);
+    ASSERT_EQ(mkfifo(previous.c_str(), 0644), 0);
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, left_out("telvzmnd.trace") + left_out("telvzmnd.trace.1"));
+    EXPECT_EQ(read_file(dump), no_trace_note());
+
+    ASSERT_EQ(unlink(previous.c_str()), 0);
+    make_directory(previous);
+    write_file(data + "/elsewhere", trace_lines(1, 1));
+    ASSERT_EQ(unlink(trace.c_str()), 0);
+    ASSERT_EQ(symlink("elsewhere", trace.c_str()), 0);
+    outcome relative_link = stba();
+    EXPECT_EQ(relative_link.status, 0);
+    EXPECT_EQ(relative_link.err, left_out("telvzmnd.trace") + left_out("telvzmnd.trace.1"));
+    EXPECT_EQ(read_file(dump), no_trace_note());
+
+    nobody_user other = nobody();
+    if (started_as_root && other.found) {
+        ASSERT_EQ(unlink(trace.c_str()), 0);
+        write_file(trace, trace_lines(1, 2));
+        ASSERT_EQ(chown(trace.c_str(), other.user, other.group), 0);
+        ASSERT_EQ(rmdir(previous.c_str()), 0);
+        write_file(previous, trace_lines(3, 1));
+        outcome foreign = stba();
+        EXPECT_EQ(foreign.status, 0);
+        EXPECT_EQ(foreign.err, left_out("telvzmnd.trace"));
+        EXPECT_EQ(foreign.out, written(1, 100));
+        EXPECT_EQ(read_file(dump), trace_lines(3, 1));
+    }
+}
+
+TEST_F(Telvzstba, ReadsOnlyTheDefaultTraceName) {
+    std::string moved = scratch + "/moved.trace";
+    write_file(moved, trace_lines(1, 1));
+    write_file(trace, trace_lines(2, 1));
+    launch how = in_data_directory();
+    how.environment.push_back("TELV_TRACE_FILE=" + moved);
+    outcome result = run(STBA, {"all", "telvzstba.trm"}, how);
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(read_file(dump), trace_lines(2, 1));
+}
+
+TEST_F(Telvzstba, ReplacesTheFileWholeAndLeavesNoTemporaryFile) {
+    write_file(trace, trace_lines(1, 2));
+    write_file(dump, "old dump\n");
+    // A second name of the old file keeps its text only if the new dump is a new file.
+    ASSERT_EQ(link(dump.c_str(), (data + "/kept").c_str()), 0);
+    outcome result = stba();
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(read_file(dump), trace_lines(1, 2));
+    EXPECT_EQ(read_file(data + "/kept"), "old dump\n");
+    EXPECT_EQ(tree_of(data), (lines{"kept", "telvzmnd.trace", "telvzstba.trm"}));
+}
+
+TEST_F(Telvzstba, RefusesBadArgumentsAndWritesNothing) {
+    write_file(trace, trace_lines(1, 1));
+    write_file(previous, trace_lines(2, 1));
+    write_file(dump, "old\n");
+    struct example {
+        std::vector<std::string> arguments;
+        std::string data_dir;
+        std::string message;
+    };
+    const std::string usage = "usage: telvzstba all FILE";
+    const std::string bad_name =
+        "the file is not a name of letters, digits, '.', '_' and '-' that begins with no '.': ";
+    std::vector<example> examples = {
+        {{}, data, usage},
+        {{"all"}, data, usage},
+        {{"all", "telvzstba.trm", "extra"}, data, usage},
+        {{"ALL", "telvzstba.trm"}, data, "unknown dump \"ALL\": the only one is \"all\""},
+        {{"", "telvzstba.trm"}, data, "unknown dump \"\": the only one is \"all\""},
+        {{"current", "telvzstba.trm"}, data, "unknown dump \"current\": the only one is \"all\""},
+        {{"all", "sub/telvzstba.trm"}, data, bad_name + "sub/telvzstba.trm"},
+        {{"all", "../telvzstba.trm"}, data, bad_name + "../telvzstba.trm"},
+        {{"all", "/tmp/telvzstba.trm"}, data, bad_name + "/tmp/telvzstba.trm"},
+        {{"all", ".."}, data, bad_name + ".."},
+        {{"all", ".hidden"}, data, bad_name + ".hidden"},
+        {{"all", ".telvzmnd.trace.lock"}, data, bad_name + ".telvzmnd.trace.lock"},
+        {{"all", ""}, data, bad_name},
+        {{"all", "a b"}, data, bad_name + "a b"},
+        {{"all", "x;y"}, data, bad_name + "x;y"},
+        {{"all", "telvzmnd.trace"}, data, "the file is the trace itself: telvzmnd.trace"},
+        {{"all", "telvzmnd.trace.1"}, data, "the file is the trace itself: telvzmnd.trace.1"},
+        {{"all", "telvzstba.trm"}, "data", "the data directory is not an absolute path: data"},
+        {{"all", "telvzstba.trm"},
+         scratch + "/nodata",
+         "no data directory: " + scratch + "/nodata"},
+    };
+    if (started_as_root && nobody().found) {
+        std::string foreign = scratch + "/foreign";
+        make_directory(foreign);
+        ASSERT_EQ(chown(foreign.c_str(), nobody().user, nobody().group), 0);
+        examples.push_back({{"all", "telvzstba.trm"},
+                            foreign,
+                            "the data directory does not belong to user 0: " + foreign});
+    }
+    for (const example &each : examples) {
+        launch how;
+        how.environment = {"TELV_DATA_DIR=" + each.data_dir};
+        outcome result = run(STBA, each.arguments, how);
+        EXPECT_EQ(result.status, 2) << each.message;
+        EXPECT_EQ(result.out, "") << each.message;
+        EXPECT_EQ(result.err, "telvzstba: " + each.message + "\n");
+        EXPECT_EQ(tree_of(data), (lines{"telvzmnd.trace", "telvzmnd.trace.1", "telvzstba.trm"}))
+            << each.message;
+        EXPECT_EQ(read_file(dump), "old\n") << each.message;
+        EXPECT_EQ(read_file(trace), trace_lines(1, 1)) << each.message;
+        EXPECT_EQ(read_file(previous), trace_lines(2, 1)) << each.message;
+    }
+    if (started_as_root && nobody().found) {
+        EXPECT_EQ(tree_of(scratch + "/foreign"), lines{});
+    }
+}
+
+TEST_F(Telvzstba, RunsThroughRunAsRootAsTheMonitorCallsIt) {
+    write_file(previous, trace_lines(1, 1));
+    write_file(trace, trace_lines(2, 2));
+    launch how = in_data_directory();
+    how.environment.push_back("PATH=/nowhere");
+    outcome result = run(RUN_AS_ROOT, {"telvzstba", "all", "telvzstba.trm"}, how);
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, written(3, 300));
+    EXPECT_EQ(read_file(dump), trace_lines(1, 3));
 }
 
 } // namespace
