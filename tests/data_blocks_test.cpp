@@ -240,3 +240,24 @@ TEST_F(PsDataBlock, ClearEmptiesWhatWasWritten) {
 }
 
 } // namespace
+
+namespace {
+
+TEST(ErrorText, ReplacesTheWholeBlock) {
+    std::memset(topDataBlock, 'x', TOP_DATA_BLOCK_SIZE);
+    write_error_text("\n\rError Information: \n\r%s\n\r", "name");
+    const std::string expected = "\n\rError Information: \n\rname\n\r";
+    EXPECT_EQ(std::string(topDataBlock), expected);
+    EXPECT_TRUE(std::all_of(topDataBlock + expected.size(), topDataBlock + TOP_DATA_BLOCK_SIZE,
+                            [](char c) { return c == '\0'; }));
+}
+
+TEST(ErrorText, LongerTextIsCutAtTheBlocksLastByte) {
+    const std::string name(TOP_DATA_BLOCK_SIZE * 2, 'n');
+    write_error_text("head %s", name.c_str());
+    EXPECT_EQ(topDataBlock[TOP_DATA_BLOCK_SIZE - 1], '\0');
+    EXPECT_EQ(std::strlen(topDataBlock), TOP_DATA_BLOCK_SIZE - 1);
+    EXPECT_EQ(std::string(topDataBlock, 5), "head ");
+}
+
+} // namespace

@@ -1,6 +1,8 @@
 #include "data_blocks.h"
 
 #include <algorithm>
+#include <cstdarg>
+#include <cstdio>
 #include <cstring>
 
 char primaryDataBlock[PRIMARY_DATA_BLOCK_SIZE];
@@ -100,6 +102,14 @@ void clear_primary_data_block() {
     std::memset(primaryDataBlock, 0, primary_high_water);
     primary_length = 0;
     primary_high_water = 0;
+}
+
+void write_error_text(const char *format, ...) {
+    std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
+    va_list arguments;
+    va_start(arguments, format);
+    std::vsnprintf(topDataBlock, TOP_DATA_BLOCK_SIZE, format, arguments);
+    va_end(arguments);
 }
 
 void copy_to_ps_data_block(const char *from) {

@@ -51,6 +51,10 @@ size_t primary_data_length();
 // Empties primaryDataBlock, clearing only as far as anything was written since the last clear.
 void clear_primary_data_block();
 
+// Replaces the error text of this pass's finding: topDataBlock is cleared whole, as the check's own
+// rewrite of it, and takes the formatted text, as much of it as the block holds.
+void write_error_text(const char *format, ...) __attribute__((format(printf, 1, 2)));
+
 // newPSDataBlock takes the text from `from` on, as much of it as the block holds; its last byte is
 // always NUL, so a longer text keeps its first 249,999 bytes. Whatever it held before is cleared.
 void copy_to_ps_data_block(const char *from);

@@ -149,10 +149,9 @@ void judge_rss(pp_memory_pass &pass, const char *text, int32_t pid, int32_t rss,
     // The value traced under the name rss has always been the vsize.
     tracesvc_trace("TARNMNDF: rss = %d (dec)", vsize);
     tracesvc_trace("TARNMNDF: Entire line was [%s]", text);
-    std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
-    std::snprintf(topDataBlock, TOP_DATA_BLOCK_SIZE,
-                  "\n\rError Information: \n\r%sEntire line was: \n\r%s\n\r",
-                  abort ? "RSS Abort Threshold exceeded\n\r" : "RSS Threshold exceeded\n\r", text);
+    write_error_text("\n\rError Information: \n\r%sEntire line was: \n\r%s\n\r",
+                     abort ? "RSS Abort Threshold exceeded\n\r" : "RSS Threshold exceeded\n\r",
+                     text);
     *pass.takeLogCrc = abort ? RC_PROCESS_RSS_ABORT : RC_PROCESS_RSS;
     *pass.takeLogValue = rss;
     if (abort) {

@@ -351,11 +351,9 @@ void report_leak(const trend_row &row, const char *name, int32_t increases) {
     tracesvc_trace(
         "TARNTRAF: process never went down over %d snapshots and increased %d of those times.",
         trend_analysis_points, increases);
-    std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
-    std::snprintf(topDataBlock, TOP_DATA_BLOCK_SIZE,
-                  "\n\rError Information: \n\rPossible memory leak detected via longterm "
-                  "analysis!\n\rprocess name is: \n\r%s\n\r",
-                  name);
+    write_error_text("\n\rError Information: \n\rPossible memory leak detected via longterm "
+                     "analysis!\n\rprocess name is: \n\r%s\n\r",
+                     name);
     tarn_mon_error_handler(LEAK_REPORT_SRC, static_cast<uint32_t>(pid), RC_VSIZE_TREND);
 }
 

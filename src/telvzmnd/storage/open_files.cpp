@@ -83,11 +83,9 @@ void close_block(open_files_listing &listing, const char *header) {
         // The line quoted is the header that closed the block: the next directory's, not the
         // reported one's, which lsDataBlock still holds.
         report_block(listing, "TARNMNDF: too many open files in process", header);
-        std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
-        std::snprintf(topDataBlock, TOP_DATA_BLOCK_SIZE,
-                      "\n\rError Information: \n\rtoo many open files in process\n\r"
-                      "Entire line was: \n\r%s\n\r",
-                      header);
+        write_error_text("\n\rError Information: \n\rtoo many open files in process\n\r"
+                         "Entire line was: \n\r%s\n\r",
+                         header);
     }
     append_block_summary(listing.block_lines);
     listing.block_lines = 0;
