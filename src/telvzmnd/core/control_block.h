@@ -121,6 +121,12 @@ inline uint32_t read_field(const uint32_t &field) {
 inline void write_field(uint32_t &field, uint32_t value) {
     __atomic_store_n(&field, value, __ATOMIC_RELAXED);
 }
+inline int32_t read_field(const int32_t &field) {
+    return __atomic_load_n(&field, __ATOMIC_RELAXED);
+}
+inline void write_field(int32_t &field, int32_t value) {
+    __atomic_store_n(&field, value, __ATOMIC_RELAXED);
+}
 
 extern uint32_t shKey;                    // key of the segment and of the semaphore set
 extern int32_t shmid;                     // id of the segment; -1 until one is found

@@ -25,3 +25,13 @@ int32_t read_number(const char *word);
 inline int32_t wrap32(int64_t value) {
     return static_cast<int32_t>(static_cast<uint32_t>(value));
 }
+
+// A quotient of the monitor's float or double arithmetic taken as a 32-bit integer, truncated
+// toward zero. A value outside the 32-bit range, or not a number, gives INT32_MIN: the value the
+// processor's truncating conversion gives, and never undefined behaviour.
+inline int32_t truncate32(double value) {
+    if (!(value > -2147483649.0 && value < 2147483648.0)) {
+        return INT32_MIN;
+    }
+    return static_cast<int32_t>(value);
+}

@@ -143,11 +143,7 @@ int32_t memory_percent(const free_figures &figures, int32_t in_use) {
     if (total == 0) {
         return INT32_MIN;
     }
-    double percent = 1000.0 * in_use / total;
-    if (!(percent > -2147483649.0 && percent < 2147483648.0)) {
-        return INT32_MIN;
-    }
-    return static_cast<int32_t>(percent);
+    return truncate32(1000.0 * in_use / total);
 }
 
 TARN_EXPORT uint32_t tarn_check_system_memory(int32_t *takeLogCrc, int32_t *takeLogValue,
