@@ -952,3 +952,28 @@ TEST(ProcessListingOnThisMachine, SpinningChildTakesAPlausibleShare) {
 }
 
 } // namespace
+
+namespace {
+
+TEST_F(ProcessListing, ZeroCellsAreThoseTheFormattingWrites) {
+    tree->set_process(7, "init", 10, 4);
+    update_process_list(&process_list);
+    process_entry *init = entry_of(7);
+    ASSERT_NE(init, nullptr);
+    const float values[PROCESS_SAMPLES] = {0.0f, -0.0f, 0.004f, -0.004f, 1.0f,
+                                           0.0f, 0.0f,  0.0f,   0.0f,    0.0f};
+    std::string expected = "user:   ";
+    for (int k = 0; k < PROCESS_SAMPLES; ++k) {
+        int slot = (process_list.current_sample + PROCESS_SAMPLES - 1 - k) % PROCESS_SAMPLES;
+        init->user_percent[slot] = values[k];
+        char cell[32];
+        std::snprintf(cell, sizeof cell, "|%+#10.2f| ", static_cast<double>(values[k]));
+        expected += cell;
+    }
+    expected += '\n';
+    const std::string table = print_to_text();
+    EXPECT_NE(table.find(expected), std::string::npos) << table;
+    EXPECT_NE(expected.find("|     -0.00| "), std::string::npos);
+}
+
+} // namespace
