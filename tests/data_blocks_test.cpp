@@ -261,3 +261,28 @@ TEST(ErrorText, LongerTextIsCutAtTheBlocksLastByte) {
 }
 
 } // namespace
+
+namespace {
+
+// The two error-text blocks after a clear hold what a whole clear leaves, whatever was written.
+TEST(ErrorText, ClearLeavesBothBlocksAsAWholeClearWould) {
+    write_error_text("%s", std::string(3000, 'a').c_str());
+    copy_error_text_to_log();
+    write_error_text("short");
+    clear_error_texts();
+    EXPECT_TRUE(std::all_of(topDataBlock, topDataBlock + TOP_DATA_BLOCK_SIZE,
+                            [](char c) { return c == '\0'; }));
+    EXPECT_TRUE(std::all_of(topLogDataBlock, topLogDataBlock + TOP_DATA_BLOCK_SIZE,
+                            [](char c) { return c == '\0'; }));
+}
+
+TEST(ErrorText, CopyToTheLogIsAWholeCopy) {
+    clear_error_texts();
+    write_error_text("%s", std::string(3000, 'a').c_str());
+    copy_error_text_to_log();
+    write_error_text("second");
+    copy_error_text_to_log();
+    EXPECT_EQ(std::memcmp(topLogDataBlock, topDataBlock, TOP_DATA_BLOCK_SIZE), 0);
+}
+
+} // namespace

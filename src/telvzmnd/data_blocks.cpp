@@ -28,6 +28,8 @@ size_t ps_high_water;      // bytes of newPSDataBlock written since its last cle
 size_t ls_length;          // strlen(lsDataBlock), kept by every append
 size_t ls_high_water;      // bytes of lsDataBlock written since its last clear
 bool ls_full;              // a line was dropped since the last clear: the rest of it goes too
+size_t top_high_water;     // bytes of topDataBlock written since its last clear
+size_t top_log_high_water; // bytes of topLogDataBlock written since its last clear
 
 void append_bytes(const char *text, size_t length) {
     size_t room = PRIMARY_DATA_BLOCK_SIZE - 1 - primary_length;
@@ -108,8 +110,23 @@ void write_error_text(const char *format, ...) {
     std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
     va_list arguments;
     va_start(arguments, format);
-    std::vsnprintf(topDataBlock, TOP_DATA_BLOCK_SIZE, format, arguments);
+    int length = std::vsnprintf(topDataBlock, TOP_DATA_BLOCK_SIZE, format, arguments);
     va_end(arguments);
+    top_high_water = length < 0 ? TOP_DATA_BLOCK_SIZE
+                                : std::min(static_cast<size_t>(length) + 1, TOP_DATA_BLOCK_SIZE);
+}
+
+void copy_error_text_to_log() {
+    std::memset(topLogDataBlock, 0, top_log_high_water);
+    std::memcpy(topLogDataBlock, topDataBlock, top_high_water);
+    top_log_high_water = top_high_water;
+}
+
+void clear_error_texts() {
+    std::memset(topDataBlock, 0, top_high_water);
+    std::memset(topLogDataBlock, 0, top_log_high_water);
+    top_high_water = 0;
+    top_log_high_water = 0;
 }
 
 void copy_to_ps_data_block(const char *from) {

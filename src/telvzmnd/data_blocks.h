@@ -54,6 +54,12 @@ void clear_primary_data_block();
 // Replaces the error text of this pass's finding: topDataBlock is cleared whole, as the check's own
 // rewrite of it, and takes the formatted text, as much of it as the block holds.
 void write_error_text(const char *format, ...) __attribute__((format(printf, 1, 2)));
+// topLogDataBlock becomes a copy of all of topDataBlock, which heads the event's attachment.
+void copy_error_text_to_log();
+// Empties topDataBlock and topLogDataBlock. Like every clear of a block, these clear only as far
+// as the blocks were written since their last clear, which leaves the bytes of a whole clear: the
+// code that writes them is above and nowhere else.
+void clear_error_texts();
 
 // newPSDataBlock takes the text from `from` on, as much of it as the block holds; its last byte is
 // always NUL, so a longer text keeps its first 249,999 bytes. Whatever it held before is cleared.
