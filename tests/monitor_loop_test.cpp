@@ -5,10 +5,13 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <csignal>
 #include <cstdint>
+#include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <filesystem>
 #include <functional>
 #include <map>
 #include <optional>
@@ -118,6 +121,11 @@ const std::string FREE_QUIET =
     "               total        used        free      shared  buff/cache   available\n"
     "Mem:         1000000      200000      600000        1000      200000      700000\n"
     "Swap:              0           0           0\n";
+// 950 KB of 1,000,000 in use: 95.0 %.
+const std::string FREE_FULL =
+    "               total        used        free      shared  buff/cache   available\n"
+    "Mem:         1000000      900000       10000        1000       40000       50000\n"
+    "Swap:              0           0           0\n";
 const std::string MEMINFO = "MemTotal:        1000000 kB\nMemFree:          600000 kB\n";
 const std::string FILE_NR = "1000\t0\t100000\n";
 const std::string LSMON = "/proc/1/fd:\ntotal 0\nlrwx------ 1 root root 64 Nov 24 02:00 0 -> "
@@ -133,6 +141,20 @@ std::string df_space(int slash_percent, int extra_percent = 10) {
 }
 const std::string DF_INODES = "Filesystem      Inodes  IUsed   IFree IUse% Mounted on\n"
                               "/dev/vda1      1310720 123456 1187264   10% /\n";
+
+std::string ps_line(int pid, int rss) {
+    std::string text = std::to_string(pid);
+    text = std::string(5 - std::min<size_t>(5, text.size()), ' ') + text;
+    std::string tid = text;
+    std::string size = std::to_string(rss);
+    return text + " " + tid + " " + size + "  20000  3000 victim          00:00:01\n";
+}
+
+// A df that prints `space` for "df -h -l -T" and `inodes` for "df --inodes -l".
+std::string df_script(const std::string &space, const std::string &inodes = DF_INODES) {
+    return "#!/bin/sh\nif [ \"$1\" = -h ]; then printf '%s' '" + space + "'; else printf '%s' '" +
+           inodes + "'; fi\n";
+}
 
 class MonitorLoop : public ::testing::Test {
   protected:
@@ -189,8 +211,7 @@ class MonitorLoop : public ::testing::Test {
 
     void set_ps(const std::string &listing) { fakes.add_printing("ps", listing); }
     void set_df(const std::string &space, const std::string &inodes = DF_INODES) {
-        fakes.add("df", "#!/bin/sh\nif [ \"$1\" = -h ]; then printf '%s' '" + space +
-                            "'; else printf '%s' '" + inodes + "'; fi\n");
+        fakes.add("df", df_script(space, inodes));
     }
     // lsmon.sh's listing, telvzstba's dump, and nothing from the listing and clean-up runs.
     void set_run_as_root() {
@@ -569,14 +590,6 @@ class signal_recorder {
     pid_t pid_ = 0;
 };
 
-std::string ps_line(int pid, int rss) {
-    std::string text = std::to_string(pid);
-    text = std::string(5 - std::min<size_t>(5, text.size()), ' ') + text;
-    std::string tid = text;
-    std::string size = std::to_string(rss);
-    return text + " " + tid + " " + size + "  20000  3000 victim          00:00:01\n";
-}
-
 TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAndKill) {
     write_control(control_text({}));
     signal_recorder victim;
@@ -647,6 +660,105 @@ TEST_F(MonitorLoop, SnapshotIntervalOfZeroWritesNoPlainSnapshotAndNoTrend) {
     EXPECT_EQ(count_of(snapshots(), PLAIN_OPENING), 0);
     EXPECT_TRUE(trace_indexes("TARNMNDF: Perform trend analysis").empty());
 }
+
+// ---- Each check's findings through the whole pass ----
+
+struct finding_case {
+    const char *name;
+    std::map<std::string, std::string> settings;
+    std::function<void(fake_commands &)> host; // what the host's commands print instead
+    uint16_t code;
+    uint32_t value;
+};
+
+class MonitorLoopFinding : public MonitorLoop,
+                           public ::testing::WithParamInterface<finding_case> {};
+
+TEST_P(MonitorLoopFinding, FindingIsReportedWithItsCodeValueAndErrorText) {
+    const finding_case &c = GetParam();
+    write_control(control_text(c.settings));
+    c.host(fakes);
+    run_once();
+    ASSERT_EQ(rec::events().size(), 1u) << std::hex << rec::events()[0].record.reason_code;
+    const rec::Event &event = rec::events()[0];
+    EXPECT_EQ(event.record.reason_code, c.code) << std::hex << event.record.reason_code;
+    EXPECT_EQ(event.record.comp_rc, c.value);
+    // The attachment opens with the finding's error text, which the loop copied for the event.
+    const std::string error_text = topLogDataBlock;
+    EXPECT_EQ(event.attachment.substr(0, error_text.size()), error_text);
+    // Staging consumed the error text itself: its first byte is NUL, the rest is the copy's.
+    EXPECT_EQ(topDataBlock[0], '\0');
+    EXPECT_EQ(std::string(topLogDataBlock + 1, TOP_DATA_BLOCK_SIZE - 1),
+              std::string(topDataBlock + 1, TOP_DATA_BLOCK_SIZE - 1));
+    const std::string file = snapshots();
+    EXPECT_EQ(file.rfind(PROBLEM_OPENING + "\n\r" + STAMP + error_text + "\n\r", 0), 0u);
+    EXPECT_EQ(TARN_CB_PTR->tookLog, 1u);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Checks, MonitorLoopFinding,
+    ::testing::Values(
+        finding_case{
+            "ProcessRss",
+            {},
+            [](fake_commands &f) { f.add_printing("ps", PS_QUIET + ps_line(4242, 1500000)); },
+            RC_PROCESS_RSS,
+            1500000},
+        finding_case{"TooManyProcesses",
+                     {{"NUM_THREADS_THRESHOLD", "11"}},
+                     [](fake_commands &f) {
+                         std::string listing;
+                         for (int pid = 100; pid < 113; ++pid) {
+                             listing += ps_line(pid, 1000);
+                         }
+                         f.add_printing("ps", listing);
+                     },
+                     RC_TOO_MANY_PROCESSES,
+                     13},
+        finding_case{"MemoryInUse",
+                     {},
+                     [](fake_commands &f) { f.add_printing("free", FREE_FULL); },
+                     RC_MEMORY_IN_USE,
+                     950},
+        finding_case{"SwapTooSmall",
+                     {{"MIN_SWAP_SIZE", "100"}},
+                     [](fake_commands &) {},
+                     RC_SWAP_TOO_SMALL,
+                     0},
+        finding_case{"KnownPartitionInodes",
+                     {},
+                     [](fake_commands &f) {
+                         f.add("df", df_script(df_space(10),
+                                               "Filesystem      Inodes  IUsed   IFree IUse% "
+                                               "Mounted on\n/dev/vda1      1310720 123456 "
+                                               "1187264   95% /\n"));
+                     },
+                     0xE146,
+                     950},
+        finding_case{"OtherPartitionSpace",
+                     {},
+                     [](fake_commands &f) {
+                         f.add("df", df_script(df_space(10) +
+                                               "/dev/vdc1      ext4       20G   10G   10G  "
+                                               "95% /srv\n"));
+                     },
+                     RC_OTHER_PARTITION_SPACE,
+                     950},
+        finding_case{"SystemDescriptors",
+                     {},
+                     [](fake_commands &f) {
+                         f.add("cat", "#!/bin/sh\ncase \"$1\" in\n/proc/sys/fs/file-nr) "
+                                      "printf '90000\\t0\\t100000\\n' ;;\n*) printf '%s' '" +
+                                          MEMINFO + "' ;;\nesac\n");
+                     },
+                     RC_SYSTEM_DESCRIPTORS,
+                     900},
+        finding_case{"ProcessDescriptors",
+                     {{"PP_FILE_DESCRIPTORS_THRESHOLD", "2"}},
+                     [](fake_commands &) {},
+                     RC_PROCESS_DESCRIPTORS,
+                     3}),
+    [](const ::testing::TestParamInfo<finding_case> &info) { return info.param.name; });
 
 // ---- External routines ----
 
@@ -752,6 +864,60 @@ TEST_F(MonitorLoop, NoDriftIsFlaggedWhileTheCountdownRuns) {
     EXPECT_EQ(TARN_CB_PTR->sleep_time_percent, -1);
     EXPECT_EQ(TARN_CB_PTR->maxSleepTime, 66);
     EXPECT_TRUE(events_of(RC_SLEEP_OVERRUN).empty());
+}
+
+} // namespace
+
+namespace {
+
+// ---- Stopping, and a long run ----
+
+TEST_F(MonitorLoop, TarnmonStopFromAnotherProcessEndsTheLoopAfterTheNextPass) {
+    write_control(control_text({}));
+    char data_dir[] = "/tmp/tarn-stop-XXXXXX";
+    ASSERT_NE(mkdtemp(data_dir), nullptr);
+    const std::string command = "TELV_DATA_DIR=" + std::string(data_dir) + " '" +
+                                std::getenv("TARN_BUILD_DIR") + "/tarnmon' stop >/dev/null";
+    int status = -1;
+    on_sleep = [&command, &status](int count) {
+        if (count == 1) {
+            status = std::system(command.c_str());
+        }
+    };
+    run_monitor({"5"});
+    std::filesystem::remove_all(data_dir);
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(sleeps, 5); // the sleep runs on; the pass after it sees the request
+    EXPECT_EQ(trace_indexes("TARNMNDF: inside while loop").size(), 2u);
+}
+
+// Open descriptors of this process.
+int open_descriptors() {
+    int count = 0;
+    for ([[maybe_unused]] const auto &entry :
+         std::filesystem::directory_iterator("/proc/self/fd")) {
+        ++count;
+    }
+    return count;
+}
+
+TEST_F(MonitorLoop, ThousandPassesLeaveNoAllocationDescriptorOrChildBehind) {
+    write_control(control_text({{"SNAPSHOT_INTERVAL", "10"}, {"TREND_ANALYSIS_POINTS", "4"}},
+                               "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check1\n"));
+    rec::register_function("telvzmnd", "tarn_external_check1",
+                           reinterpret_cast<void *>(&tarn_external_check1));
+    const int descriptors = open_descriptors();
+    EXPECT_EQ(run_passes(1000), 0u);
+    EXPECT_EQ(trace_indexes("TARNMNDF: inside while loop").size(), 1000u);
+    EXPECT_EQ(count_of(snapshots(), PLAIN_OPENING) > 0, true);
+    EXPECT_TRUE(rec::events().empty());
+    delete_process_list(&process_list);
+    EXPECT_EQ(rec::live_allocations(), std::vector<std::string>{});
+    EXPECT_EQ(open_descriptors(), descriptors);
+    EXPECT_EQ(rec::open_data_files(), 0);
+    errno = 0;
+    EXPECT_EQ(waitpid(-1, nullptr, WNOHANG), -1);
+    EXPECT_EQ(errno, ECHILD);
 }
 
 } // namespace
