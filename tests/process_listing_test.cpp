@@ -4,6 +4,7 @@
 
 #include <chrono>
 #include <csignal>
+#include <cstdint>
 #include <cstring>
 #include <optional>
 #include <spawn.h>
@@ -658,6 +659,260 @@ TEST_F(ProcessListing, ParserStaysWithinTheNameOnHostileLines) {
         EXPECT_LE(parse_process_stat_line(garbage, area.name, &utime, &stime, &priority, &nice), 1)
             << garbage;
         EXPECT_EQ(std::string(area.guard, sizeof area.guard), std::string(64, 'G'));
+    }
+}
+
+// What parse_process_stat_line leaves of one line, each output starting from a value of its own
+// so that a field the parse does not convert is seen to keep it.
+struct parsed_stat {
+    char name[PROCESS_NAME_LENGTH] = "(old)";
+    uint32_t utime = 11;
+    uint32_t stime = 12;
+    int32_t priority = 13;
+    int32_t nice = 14;
+    int converted;
+
+    explicit parsed_stat(const std::string &text)
+        : converted(parse_process_stat_line(text.c_str(), name, &utime, &stime, &priority, &nice)) {
+    }
+};
+
+// The fields after nice, as the kernel writes them for a live process.
+const std::string after_nice = " 1 0 4242 12582912 812 18446744073709551615 94016 94812 140722 0 0 "
+                               "0 0 4096 17642 0 0 0 17 1 0 0 0 0 0 94901 94956 95008 140722 "
+                               "140723 140723 140724 0\n";
+
+TEST_F(ProcessListing, ParserReadsTheKernelsLines) {
+    parsed_stat init("1 (systemd) S 0 1 1 0 -1 4194560 54390 1750853 0 211 127 747 2152 1104 20 0 "
+                     "1 0 24 45641728 3642 18446744073709551615 1 1 0 0 0 0 671173123 4096 1260 0 "
+                     "0 0 17 0 0 0 0 0 0 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(init.converted, 5);
+    EXPECT_STREQ(init.name, "(systemd)");
+    EXPECT_EQ(init.utime, 127u);
+    EXPECT_EQ(init.stime, 747u);
+    EXPECT_EQ(init.priority, 20);
+    EXPECT_EQ(init.nice, 0);
+
+    parsed_stat kernel_thread("2 (kthreadd) S 0 0 0 0 -1 2129984 0 0 0 0 0 12 0 0 20 0 1 0 5 0 0 "
+                              "18446744073709551615 0 0 0 0 0 0 0 2147483647 0 1 0 0 0 1 0 0 0 0 "
+                              "0 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(kernel_thread.converted, 5);
+    EXPECT_STREQ(kernel_thread.name, "(kthreadd)");
+    EXPECT_EQ(kernel_thread.utime, 0u);
+    EXPECT_EQ(kernel_thread.stime, 12u);
+    EXPECT_EQ(kernel_thread.priority, 20);
+    EXPECT_EQ(kernel_thread.nice, 0);
+
+    // A real-time thread: the kernel writes its priority negative.
+    parsed_stat real_time("15 (migration/0) S 2 0 0 0 -1 69238848 0 0 0 0 0 301 0 0 -100 0 1 0 5 "
+                          "0 0 18446744073709551615 0 0 0 0 0 0 0 2147483647 0 1 0 0 17 0 99 1 0 "
+                          "0 0 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(real_time.converted, 5);
+    EXPECT_STREQ(real_time.name, "(migration/0)");
+    EXPECT_EQ(real_time.utime, 0u);
+    EXPECT_EQ(real_time.stime, 301u);
+    EXPECT_EQ(real_time.priority, -100);
+    EXPECT_EQ(real_time.nice, 0);
+
+    // Parentheses inside the name, and the lowest scheduling weight.
+    parsed_stat nested("1234 ((sd-pam)) S 1233 1233 1233 0 -1 1077936448 50 0 0 0 3 1 0 0 39 19 1 "
+                       "0 1500 108388352 1074 18446744073709551615 1 1 0 0 0 0 0 4096 0 0 0 0 17 1 "
+                       "0 0 0 0 0 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(nested.converted, 5);
+    EXPECT_STREQ(nested.name, "((sd-pam))");
+    EXPECT_EQ(nested.utime, 3u);
+    EXPECT_EQ(nested.stime, 1u);
+    EXPECT_EQ(nested.priority, 39);
+    EXPECT_EQ(nested.nice, 19);
+
+    parsed_stat idle_worker("4321 (kworker/0:1H-kblockd) I 2 0 0 0 -1 69238880 0 0 0 0 0 88 0 0 0 "
+                            "-20 1 0 187 0 0 18446744073709551615 0 0 0 0 0 0 0 2147483647 0 1 0 "
+                            "0 17 0 0 0 0 0 0 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(idle_worker.converted, 5);
+    EXPECT_STREQ(idle_worker.name, "(kworker/0:1H-kblockd)");
+    EXPECT_EQ(idle_worker.utime, 0u);
+    EXPECT_EQ(idle_worker.stime, 88u);
+    EXPECT_EQ(idle_worker.priority, 0);
+    EXPECT_EQ(idle_worker.nice, -20);
+
+    parsed_stat zombie("999 (zombie) Z 1 999 999 0 -1 4227084 0 0 0 0 7 2 0 0 20 0 1 0 7777 0 0 "
+                       "18446744073709551615 0 0 0 0 0 0 0 0 0 0 0 0 17 1 0 0 0 0 0 0 0 0 0 0 0 0 "
+                       "0\n");
+    EXPECT_EQ(zombie.converted, 5);
+    EXPECT_STREQ(zombie.name, "(zombie)");
+    EXPECT_EQ(zombie.utime, 7u);
+    EXPECT_EQ(zombie.stime, 2u);
+    EXPECT_EQ(zombie.priority, 20);
+    EXPECT_EQ(zombie.nice, 0);
+}
+
+TEST_F(ProcessListing, ParserTakesAnyWhiteSpaceBetweenFields) {
+    parsed_stat spaced("\v\f79\t(x)\nS\r1 79 79 0 -1 4194560 1523 0 12 0 57\n31\t0 0 20\f-3");
+    EXPECT_EQ(spaced.converted, 5);
+    EXPECT_STREQ(spaced.name, "(x)");
+    EXPECT_EQ(spaced.utime, 57u);
+    EXPECT_EQ(spaced.stime, 31u);
+    EXPECT_EQ(spaced.priority, 20);
+    EXPECT_EQ(spaced.nice, -3);
+}
+
+TEST_F(ProcessListing, ParserTakesTheNameOnlyUpToItsFirstBlank) {
+    // The first character after the blank is taken as the state, and what follows it up to the
+    // ")" is no number: only the name converts, the rest keeps its values.
+    for (const char *name : {"tmux: server", "Web Content", "a\nb", "a "}) {
+        parsed_stat shifted("4711 (" + std::string(name) +
+                            ") S 1 4711 4711 0 -1 4194560 1523 0 12 0 57 31 0 0 20 0" + after_nice);
+        EXPECT_EQ(shifted.converted, 1) << name;
+        EXPECT_EQ(shifted.utime, 11u) << name;
+        EXPECT_EQ(shifted.stime, 12u) << name;
+        EXPECT_EQ(shifted.priority, 13) << name;
+        EXPECT_EQ(shifted.nice, 14) << name;
+    }
+    EXPECT_STREQ(parsed_stat("4711 (tmux: server) S 1" + after_nice).name, "(tmux:");
+    EXPECT_STREQ(parsed_stat("4711 (Web Content) S 1" + after_nice).name, "(Web");
+    EXPECT_STREQ(parsed_stat("4711 (a\nb) S 1" + after_nice).name, "(a");
+    EXPECT_STREQ(parsed_stat("4711 (a ) S 1" + after_nice).name, "(a");
+}
+
+TEST_F(ProcessListing, ParserCutsALongNameAndReadsOnFromThere) {
+    // 98 characters of the name are taken; the 99th counts as the state, and the 100th starts a
+    // field that is no number.
+    parsed_stat long_name("1 (" + std::string(200, 'x') +
+                          ") S 0 1 1 0 -1 4194560 1 2 3 4 57 31 0 0 20 0" + after_nice);
+    EXPECT_EQ(long_name.converted, 1);
+    EXPECT_EQ(std::string(long_name.name), "(" + std::string(97, 'x'));
+    EXPECT_EQ(long_name.utime, 11u);
+    EXPECT_EQ(long_name.stime, 12u);
+    EXPECT_EQ(long_name.priority, 13);
+    EXPECT_EQ(long_name.nice, 14);
+
+    // The state is taken from within the name, then the numbers 7 and 8 from it; its ")" is no
+    // number.
+    parsed_stat digits_inside("1 (" + std::string(97, 'n') +
+                              "R 7 8) S 0 1 1 0 -1 4194560 1 2 3 4 57 31 0 0 20 0" + after_nice);
+    EXPECT_EQ(digits_inside.converted, 1);
+    EXPECT_EQ(std::string(digits_inside.name), "(" + std::string(97, 'n'));
+    EXPECT_EQ(digits_inside.utime, 11u);
+}
+
+TEST_F(ProcessListing, ParserReadsNumbersBeyondTheirRangeAsTheConversionsDo) {
+    // Above 2^32 the counters keep their low 32 bits; priority and nice are converted as longs
+    // and keep their low 32 bits too.
+    parsed_stat above_32_bits("77 (big) R 1 77 77 0 -1 4194560 1 2 3 4 4294967296 4294967301 0 0 "
+                              "4294967316 2147483648" +
+                              after_nice);
+    EXPECT_EQ(above_32_bits.converted, 5);
+    EXPECT_EQ(above_32_bits.utime, 0u);
+    EXPECT_EQ(above_32_bits.stime, 5u);
+    EXPECT_EQ(above_32_bits.priority, 20);
+    EXPECT_EQ(above_32_bits.nice, INT32_MIN);
+
+    // Beyond 64 bits a counter reads as all ones; just below, as its low 32 bits. Priority and
+    // nice beyond the range of a long are held at its largest value, whose low 32 bits are -1.
+    parsed_stat above_64_bits("77 (big) R 1 77 77 0 -1 4194560 1 2 3 4 18446744073709551616 "
+                              "18446744069414584327 0 0 9223372036854775807 9223372036854775808" +
+                              after_nice);
+    EXPECT_EQ(above_64_bits.converted, 5);
+    EXPECT_EQ(above_64_bits.utime, UINT32_MAX);
+    EXPECT_EQ(above_64_bits.stime, 7u);
+    EXPECT_EQ(above_64_bits.priority, -1);
+    EXPECT_EQ(above_64_bits.nice, -1);
+
+    // A skipped field of any length is still a number; below the range of a long the values are
+    // held at its smallest, whose low 32 bits are 0.
+    parsed_stat far_below("77 (big) R 1 77 77 0 -1 4194560 99999999999999999999999 2 3 4 5 6 "
+                          "99999999999999999999999 -99999999999999999999999 -9223372036854775808 "
+                          "-9223372036854775809" +
+                          after_nice);
+    EXPECT_EQ(far_below.converted, 5);
+    EXPECT_EQ(far_below.utime, 5u);
+    EXPECT_EQ(far_below.stime, 6u);
+    EXPECT_EQ(far_below.priority, 0);
+    EXPECT_EQ(far_below.nice, 0);
+}
+
+TEST_F(ProcessListing, ParserNegatesANegativeCounterInUnsignedArithmetic) {
+    parsed_stat negative("78 (neg) S 1 78 78 0 -1 4194560 1 2 3 4 -1 -5 0 0 -2147483649 "
+                         "-4294967296" +
+                         after_nice);
+    EXPECT_EQ(negative.converted, 5);
+    EXPECT_EQ(negative.utime, 4294967295u);
+    EXPECT_EQ(negative.stime, 4294967291u);
+    EXPECT_EQ(negative.priority, 2147483647);
+    EXPECT_EQ(negative.nice, 0);
+
+    // Minus the largest 64-bit value is 1; one more and the counter overflows to all ones.
+    parsed_stat extreme("78 (neg) S 1 78 78 0 -1 4194560 1 2 3 4 -18446744073709551615 "
+                        "-18446744073709551616 0 0 +20 -0" +
+                        after_nice);
+    EXPECT_EQ(extreme.converted, 5);
+    EXPECT_EQ(extreme.utime, 1u);
+    EXPECT_EQ(extreme.stime, UINT32_MAX);
+    EXPECT_EQ(extreme.priority, 20);
+    EXPECT_EQ(extreme.nice, 0);
+}
+
+TEST_F(ProcessListing, ParserStopsAtTheFirstFieldThatIsNoNumber) {
+    // A sign alone is no number.
+    parsed_stat sign_only("79 (x) S 1 79 79 0 -1 4194560 1523 0 12 0 - 31 0 0 20 0");
+    EXPECT_EQ(sign_only.converted, 1);
+    EXPECT_EQ(sign_only.utime, 11u);
+
+    // Numbers are decimal: "0x57" is a 0, and "x57" no number.
+    parsed_stat hexadecimal("79 (x) S 1 79 79 0 -1 4194560 1523 0 12 0 0x57 31 0 0 20 0");
+    EXPECT_EQ(hexadecimal.converted, 2);
+    EXPECT_EQ(hexadecimal.utime, 0u);
+    EXPECT_EQ(hexadecimal.stime, 12u);
+    EXPECT_EQ(hexadecimal.priority, 13);
+    EXPECT_EQ(hexadecimal.nice, 14);
+}
+
+TEST_F(ProcessListing, ParserKeepsWhatATruncatedLineDoesNotReach) {
+    parsed_stat after_stime("79 (cut) S 1 79 79 0 -1 4194560 1523 0 12 0 57 3");
+    EXPECT_EQ(after_stime.converted, 3);
+    EXPECT_STREQ(after_stime.name, "(cut)");
+    EXPECT_EQ(after_stime.utime, 57u);
+    EXPECT_EQ(after_stime.stime, 3u);
+    EXPECT_EQ(after_stime.priority, 13);
+    EXPECT_EQ(after_stime.nice, 14);
+
+    parsed_stat after_priority("79 (cut) S 1 79 79 0 -1 4194560 1523 0 12 0 57 31 0 0 20");
+    EXPECT_EQ(after_priority.converted, 4);
+    EXPECT_EQ(after_priority.priority, 20);
+    EXPECT_EQ(after_priority.nice, 14);
+
+    // Nothing after nice is taken, so a line cut right after it is whole.
+    parsed_stat after_nice_only("79 (cut) S 1 79 79 0 -1 4194560 1523 0 12 0 57 31 0 0 20 -5");
+    EXPECT_EQ(after_nice_only.converted, 5);
+    EXPECT_EQ(after_nice_only.nice, -5);
+
+    parsed_stat within_name("79 (syst");
+    EXPECT_EQ(within_name.converted, 1);
+    EXPECT_STREQ(within_name.name, "(syst");
+
+    parsed_stat after_name("79 (cut) ");
+    EXPECT_EQ(after_name.converted, 1);
+    EXPECT_STREQ(after_name.name, "(cut)");
+    EXPECT_EQ(after_name.utime, 11u);
+
+    parsed_stat pid_only("79 ");
+    EXPECT_EQ(pid_only.converted, 0);
+    EXPECT_STREQ(pid_only.name, "(old)");
+    EXPECT_EQ(pid_only.utime, 11u);
+    EXPECT_EQ(pid_only.stime, 12u);
+    EXPECT_EQ(pid_only.priority, 13);
+    EXPECT_EQ(pid_only.nice, 14);
+}
+
+TEST_F(ProcessListing, ParserConvertsNothingFromAnEmptyOrBlankLine) {
+    for (const char *text : {"", " \t\n\v\f\r"}) {
+        parsed_stat empty(text);
+        EXPECT_EQ(empty.converted, 0);
+        EXPECT_STREQ(empty.name, "(old)");
+        EXPECT_EQ(empty.utime, 11u);
+        EXPECT_EQ(empty.stime, 12u);
+        EXPECT_EQ(empty.priority, 13);
+        EXPECT_EQ(empty.nice, 14);
     }
 }
 

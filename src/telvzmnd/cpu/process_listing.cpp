@@ -250,19 +250,160 @@ void emit_percentage_row(table_text &table, const process_list_header *list, con
     row.emit(table);
 }
 
+// The reading of a stat line. Its fields are taken the way the C library's scanf takes them in the
+// C locale, so that an odd line (a name with blanks, a huge or negative counter, a cut-off line)
+// gives the same values, and the same count of them, as the accounting has always recorded.
+// A conversion that finds nothing makes the rest of the line unread, as a failed scan would.
+
+// White space as isspace sees it in the C locale: every field may be preceded by any run of it.
+bool is_white_space(char c) {
+    return c == ' ' || (c >= '\t' && c <= '\r');
+}
+
+bool is_digit(char c) {
+    return c >= '0' && c <= '9';
+}
+
+// A decimal field: an optional sign, then its digits; the magnitude saturates once it passes
+// 64 bits, where the conversion would report overflow.
+struct scanned_number {
+    bool negative = false;
+    bool beyond_64_bits = false;
+    uint64_t magnitude = 0;
+
+    // As an unsigned field is read: strtoul's value, negated in unsigned arithmetic when the
+    // field has a minus, all ones when it overflows; then cut to 32 bits.
+    uint32_t as_unsigned() const {
+        if (beyond_64_bits) {
+            return UINT32_MAX;
+        }
+        return static_cast<uint32_t>(negative ? 0 - magnitude : magnitude);
+    }
+    // As a signed field is read: strtol's value, held at LONG_MIN or LONG_MAX when it is out of
+    // range, then cut to 32 bits (so a field beyond the range reads as 0 or -1).
+    int32_t as_signed() const {
+        constexpr uint64_t largest = static_cast<uint64_t>(INT64_MAX);
+        uint64_t value;
+        if (negative) {
+            value = beyond_64_bits || magnitude > largest + 1 ? largest + 1 : 0 - magnitude;
+        } else {
+            value = beyond_64_bits || magnitude > largest ? largest : magnitude;
+        }
+        return static_cast<int32_t>(static_cast<uint32_t>(value));
+    }
+};
+
+// A position in the NUL-terminated stat text; no step moves past the NUL.
+struct stat_cursor {
+    const char *at;
+
+    void skip_white_space() {
+        while (is_white_space(*at)) {
+            ++at;
+        }
+    }
+
+    // A decimal field after white space. False when there is no digit: a sign alone is no number.
+    bool take_number(scanned_number &number) {
+        skip_white_space();
+        number = scanned_number{};
+        if (*at == '-' || *at == '+') {
+            number.negative = *at == '-';
+            ++at;
+        }
+        if (!is_digit(*at)) {
+            return false;
+        }
+        constexpr uint64_t tenth = UINT64_MAX / 10;
+        do {
+            auto digit = static_cast<uint64_t>(*at - '0');
+            if (number.magnitude > tenth ||
+                (number.magnitude == tenth && digit > UINT64_MAX % 10)) {
+                number.beyond_64_bits = true;
+            } else {
+                number.magnitude = number.magnitude * 10 + digit;
+            }
+            ++at;
+        } while (is_digit(*at));
+        return true;
+    }
+
+    // A field whose value is not kept; it only has to be there.
+    bool skip_number() {
+        scanned_number ignored;
+        return take_number(ignored);
+    }
+
+    bool skip_numbers(int count) {
+        for (int i = 0; i < count; ++i) {
+            if (!skip_number()) {
+                return false;
+            }
+        }
+        return true;
+    }
+
+    // The name field after white space: up to the next white space, at most 98 characters (the
+    // name area's last byte has never been written), NUL-terminated; the rest of a longer name is
+    // read as the fields after it. False at the end of the text.
+    bool take_name(char *name) {
+        constexpr size_t most = PROCESS_NAME_LENGTH - 2;
+        skip_white_space();
+        if (*at == '\0') {
+            return false;
+        }
+        size_t length = 0;
+        while (length < most && *at != '\0' && !is_white_space(*at)) {
+            name[length++] = *at++;
+        }
+        name[length] = '\0';
+        return true;
+    }
+
+    // One character after white space, whatever it is (the state letter). False at the end.
+    bool skip_character() {
+        skip_white_space();
+        if (*at == '\0') {
+            return false;
+        }
+        ++at;
+        return true;
+    }
+};
+
 } // namespace
 
 int parse_process_stat_line(const char *text, char *process_name, uint32_t *utime, uint32_t *stime,
                             int32_t *priority, int32_t *nice) {
     // pid (name) state ppid pgrp session tty tpgid flags minflt cminflt majflt cmajflt utime
     // stime cutime cstime priority nice ... A name with a blank shifts the fields after it; that
-    // is accepted, the process is then sampled with what the conversions left.
-    int converted = std::sscanf(
-        text,
-        "%*d %98s %*c %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %u %u %*d %*d %d %d %*d %*d %*d %*d "
-        "%*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d %*d",
-        process_name, utime, stime, priority, nice);
-    return converted < 0 ? 0 : converted;
+    // is accepted, the process is then sampled with what the conversions left. Nothing is taken
+    // after nice, so the fields that follow it are not read at all.
+    stat_cursor line{text};
+    if (!line.skip_number() || !line.take_name(process_name)) {
+        return 0;
+    }
+    if (!line.skip_character() || !line.skip_numbers(10)) {
+        return 1;
+    }
+    scanned_number field;
+    if (!line.take_number(field)) {
+        return 1;
+    }
+    *utime = field.as_unsigned();
+    if (!line.take_number(field)) {
+        return 2;
+    }
+    *stime = field.as_unsigned();
+    if (!line.skip_numbers(2) || !line.take_number(field)) {
+        return 3;
+    }
+    *priority = field.as_signed();
+    if (!line.take_number(field)) {
+        return 4;
+    }
+    *nice = field.as_signed();
+    return 5;
 }
 
 void reset_process_listing_state() {

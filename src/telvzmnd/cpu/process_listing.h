@@ -84,7 +84,9 @@ TARN_EXPORT void delete_process_list(process_list_header *list);
 
 // Reads one /proc/<pid>/stat line: the name (field 2), utime (14), stime (15), priority (18) and
 // nice (19). Returns how many of them were converted; those not converted keep their value.
-// process_name must hold PROCESS_NAME_LENGTH characters.
+// process_name must hold PROCESS_NAME_LENGTH characters. The fields are taken exactly as the C
+// library's sscanf takes "%*d %98s %*c %*d ... %u %u %*d %*d %d %d" in the C locale (returning 0
+// where it returns EOF), odd lines included; fuzz/process_stat_line.cpp holds it to that.
 int parse_process_stat_line(const char *text, char *process_name, uint32_t *utime, uint32_t *stime,
                             int32_t *priority, int32_t *nice);
 
