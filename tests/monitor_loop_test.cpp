@@ -17,6 +17,7 @@
 #include <optional>
 #include <string>
 #include <sys/shm.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
@@ -39,6 +40,15 @@
 #include "recording_platform.h"
 #include "storage/file_system.h"
 #include "text_lines.h"
+
+// Every kill of this program, the library's included (it calls the C library's kill through its
+// dynamic symbol, which a host may stand in for): recorded, then sent.
+std::vector<std::pair<pid_t, int>> kills_sent;
+
+extern "C" int kill(pid_t pid, int signal) noexcept {
+    kills_sent.emplace_back(pid, signal);
+    return static_cast<int>(syscall(SYS_kill, pid, signal));
+}
 
 namespace {
 
@@ -594,6 +604,7 @@ TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAn
     write_control(control_text({}));
     signal_recorder victim;
     set_ps(PS_QUIET + ps_line(victim.pid(), 2600000));
+    kills_sent.clear();
     run_once();
     ASSERT_EQ(events_of(RC_PROCESS_RSS_ABORT).size(), 1u);
     EXPECT_NE(rec::find_trace("TARNMNDF: going to kill process " + std::to_string(victim.pid()) +
@@ -602,8 +613,13 @@ TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAn
     EXPECT_NE(rec::find_trace("TARNMNDF: about to kill process " + std::to_string(victim.pid()) +
                               " (dec)"),
               -1);
+    // The signals as the library sent them, through the C library's kill that this program
+    // stands in for; then what reached the victim: 6 and 11 may still be pending when 9 ends it,
+    // and those that arrived came in order.
+    EXPECT_EQ(kills_sent,
+              (std::vector<std::pair<pid_t, int>>{
+                  {victim.pid(), SIGABRT}, {victim.pid(), SIGSEGV}, {victim.pid(), SIGKILL}}));
     auto [recorded, ended] = victim.outcome();
-    // 6 and 11 may still be pending when 9 ends it; those that arrived came in order.
     EXPECT_EQ(std::string("6 11 ").rfind(recorded, 0), 0u) << recorded;
     EXPECT_EQ(ended, SIGKILL);
 }
@@ -611,7 +627,9 @@ TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAn
 TEST_F(MonitorLoop, AbortFindingWithoutAPidKillsNothing) {
     write_control(control_text({}));
     set_ps(PS_QUIET + ps_line(0, 2600000));
+    kills_sent.clear();
     run_once();
+    EXPECT_TRUE(kills_sent.empty());
     ASSERT_EQ(events_of(RC_PROCESS_RSS_ABORT).size(), 1u);
     EXPECT_EQ(count_of(snapshots(), PROBLEM_OPENING), 1);
     EXPECT_TRUE(rec::traces_starting("TARNMNDF: going to kill").empty());
