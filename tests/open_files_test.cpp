@@ -220,11 +220,7 @@ class OpenFiles : public ::testing::Test {
 
     // What the loop does before the checks of a pass.
     void start_pass() {
-        clear_primary_data_block();
-        clear_ls_data_block();
-        std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
-        outbufferleft = OUTBUFFER_BUDGET;
-        pdboverflow = 0;
+        start_pass_data();
         takeLogCrc = 0;
         takeLogValue = 0;
         rec::clear_traces();

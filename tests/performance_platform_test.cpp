@@ -117,9 +117,7 @@ class PerformanceOnTheHost : public ::testing::Test {
     }
 
     void start_pass() {
-        clear_primary_data_block();
-        outbufferleft = OUTBUFFER_BUDGET;
-        pdboverflow = 0;
+        start_pass_data();
         takeLogCrc = 0;
         takeLogValue = 0;
     }

@@ -145,10 +145,7 @@ class Performance : public ::testing::Test {
 
     // What the loop does before the checks of a pass.
     void start_pass() {
-        clear_primary_data_block();
-        outbufferleft = OUTBUFFER_BUDGET;
-        pdboverflow = 0;
-        std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
+        start_pass_data();
         std::memset(line, 0, LINE_SIZE);
         takeLogCrc = 0;
         takeLogValue = 0;

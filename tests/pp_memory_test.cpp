@@ -305,10 +305,7 @@ class PpMemory : public ::testing::Test {
 
     // What the loop does before the checks of a pass.
     void start_pass() {
-        clear_primary_data_block();
-        outbufferleft = OUTBUFFER_BUDGET;
-        pdboverflow = 0;
-        std::memset(topDataBlock, 0, TOP_DATA_BLOCK_SIZE);
+        start_pass_data();
         takeLogCrc = 0;
         takeLogValue = 0;
         killPid = 0;

@@ -279,9 +279,7 @@ class SystemMemory : public ::testing::Test {
 
     // What the loop does before the checks of a pass.
     void start_pass() {
-        clear_primary_data_block();
-        outbufferleft = OUTBUFFER_BUDGET;
-        pdboverflow = 0;
+        start_pass_data();
         takeLogCrc = 0;
         takeLogValue = 0;
     }

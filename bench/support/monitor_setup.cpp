@@ -56,7 +56,5 @@ bool set_up_monitor() {
 }
 
 void start_pass() {
-    clear_primary_data_block();
-    outbufferleft = OUTBUFFER_BUDGET;
-    pdboverflow = 0;
+    start_pass_data();
 }

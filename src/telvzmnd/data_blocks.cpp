@@ -165,3 +165,11 @@ void clear_ls_data_block() {
     ls_high_water = 0;
     ls_full = false;
 }
+
+void start_pass_data() {
+    clear_primary_data_block();
+    clear_ls_data_block();
+    clear_error_texts();
+    outbufferleft = OUTBUFFER_BUDGET;
+    pdboverflow = 0;
+}

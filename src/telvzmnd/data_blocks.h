@@ -51,6 +51,10 @@ size_t primary_data_length();
 // Empties primaryDataBlock, clearing only as far as anything was written since the last clear.
 void clear_primary_data_block();
 
+// What every pass starts with: primaryDataBlock, lsDataBlock and the two error texts empty (each
+// cleared as far as it was written), the whole budget, and no overflow line yet.
+void start_pass_data();
+
 // Replaces the error text of this pass's finding: topDataBlock is cleared whole, as the check's own
 // rewrite of it, and takes the formatted text, as much of it as the block holds.
 void write_error_text(const char *format, ...) __attribute__((format(printf, 1, 2)));

@@ -251,11 +251,7 @@ void sleep_measured(tarn_control_block &block) {
 
 void run_pass(monitor_run &run) {
     tracesvc_trace("TARNMNDF: inside while loop");
-    clear_primary_data_block();
-    clear_ls_data_block();
-    clear_error_texts();
-    outbufferleft = OUTBUFFER_BUDGET;
-    pdboverflow = 0;
+    start_pass_data();
     run.takeLogCrc = 0;
     run.takeLogValue = 0;
     run.killPid = 0;
