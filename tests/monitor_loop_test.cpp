@@ -38,6 +38,7 @@
 #include "logsvc.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+#include "snapshot_stamp.h"
 #include "storage/file_system.h"
 #include "text_lines.h"
 
@@ -52,32 +53,18 @@ extern "C" int kill(pid_t pid, int signal) noexcept {
 
 namespace {
 
+using snapshot_stamp::fixed_clock;
+using snapshot_stamp::STAMP;
+
 using fake::fake_commands;
 using text::lines;
 
 constexpr uint16_t SLASH_SPACE = 0xE136; // "/" above its space threshold
 
-const std::string STAMP =
-    "Local date and time = 5 March 2021 at 07:04:09 \n\rCode Version 61.001\n\r";
 const std::string PLAIN_OPENING(PLAIN_SNAPSHOT_OPENING);
 const std::string PLAIN_CLOSING(PLAIN_SNAPSHOT_CLOSING);
 const std::string PROBLEM_OPENING(PROBLEM_SNAPSHOT_OPENING);
 const std::string PROBLEM_CLOSING(PROBLEM_SNAPSHOT_CLOSING);
-
-time_t fixed_clock(time_t *out) {
-    struct tm t {};
-    t.tm_year = 121;
-    t.tm_mon = 2;
-    t.tm_mday = 5;
-    t.tm_hour = 7;
-    t.tm_min = 4;
-    t.tm_sec = 9;
-    time_t now = timegm(&t);
-    if (out != nullptr) {
-        *out = now;
-    }
-    return now;
-}
 
 // Every setting the validation needs, at values a quiet host passes.
 const std::map<std::string, std::string> QUIET_SETTINGS = {

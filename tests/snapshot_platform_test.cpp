@@ -16,26 +16,12 @@
 #include "capture/snapshot_file.h"
 #include "core/settings.h"
 #include "data_blocks.h"
+#include "snapshot_stamp.h"
 
 namespace {
 
-const std::string STAMP =
-    "Local date and time = 5 March 2021 at 07:04:09 \n\rCode Version 61.001\n\r";
-
-time_t fixed_clock(time_t *out) {
-    struct tm t {};
-    t.tm_year = 121;
-    t.tm_mon = 2;
-    t.tm_mday = 5;
-    t.tm_hour = 7;
-    t.tm_min = 4;
-    t.tm_sec = 9;
-    time_t now = timegm(&t);
-    if (out != nullptr) {
-        *out = now;
-    }
-    return now;
-}
+using snapshot_stamp::fixed_clock;
+using snapshot_stamp::STAMP;
 
 void save(const std::string &text, int32_t final = 0) {
     std::vector<char> data(text.begin(), text.end());
