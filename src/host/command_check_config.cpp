@@ -1,10 +1,13 @@
 // tarnmon check-config [FILE]: reads a control file as the monitor reads it, parses it with the
 // monitor's own parser, and says in words whether the monitor would run with it, and if not, why.
+// tarnmon run gives the same verdict, from the same code, before it starts the monitor.
 #include <cerrno>
 #include <cinttypes>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -182,36 +185,69 @@ void print_rule_failure(const setting &entry) {
     std::printf("; the monitor does not run\n");
 }
 
+// The two variables of the default platform that the check sends to /dev/null while it runs, and
+// puts back as they were afterwards: a monitor started after the check (tarnmon run) writes its
+// own trace and events where the platform's settings say.
+class quiet_platform {
+  public:
+    quiet_platform() {
+        for (size_t i = 0; i < std::size(VARIABLES); ++i) {
+            const char *value = std::getenv(VARIABLES[i]);
+            saved_[i] = value != nullptr ? std::optional<std::string>(value) : std::nullopt;
+            setenv(VARIABLES[i], "/dev/null", 1);
+        }
+    }
+    ~quiet_platform() {
+        for (size_t i = 0; i < std::size(VARIABLES); ++i) {
+            if (saved_[i].has_value()) {
+                setenv(VARIABLES[i], saved_[i]->c_str(), 1);
+            } else {
+                unsetenv(VARIABLES[i]);
+            }
+        }
+    }
+    quiet_platform(const quiet_platform &) = delete;
+    quiet_platform &operator=(const quiet_platform &) = delete;
+
+  private:
+    static constexpr const char *VARIABLES[] = {EVENT_LOG_VARIABLE, TRACE_FILE_VARIABLE};
+    std::optional<std::string> saved_[std::size(VARIABLES)];
+};
+
 } // namespace
 
-int command_check_config(const command_line &line) {
+int check_control_file(const char *path, check_report report, int32_t *checking_interval_set) {
+    *checking_interval_set = CHECKING_INTERVAL_DEFAULT;
     // A check raises no events and writes no trace: what the parser reports while checking (an
     // unresolved routine, a failed allocation) is told here in words, and the appliance's event
     // log and trace keep only what a running monitor did. Set before anything can trace.
-    setenv(EVENT_LOG_VARIABLE, "/dev/null", 1);
-    setenv(TRACE_FILE_VARIABLE, "/dev/null", 1);
+    quiet_platform quiet;
     control_text text;
-    if (line.operands.empty()) {
+    if (path == nullptr) {
         read_through_data_files(text);
     } else {
-        read_from_path(text, line.operands[0]);
+        read_from_path(text, path);
     }
     if (std::string problem = read_problem(text); !problem.empty()) {
         std::printf("PROBLEM: the control file %s %s\n", text.where.c_str(), problem.c_str());
         return text.opened ? EXIT_FINDING : EXIT_UNAVAILABLE;
     }
     text.bytes[CONTROL_FILE_MAX - 1] = '\0';
-    std::printf("Control file: %s (%u bytes read)\n\n", text.where.c_str(), text.length);
+    std::printf("Control file: %s (%u bytes read)\n", text.where.c_str(), text.length);
 
     // As monitoring starts without a checking interval from its host.
     settings_start_values();
     uint32_t crc = 0;
     uint32_t src = tarn_parse_control_file(text.bytes.data(), &crc);
+    *checking_interval_set = checking_interval;
     control_file_tables tables{};
     read_control_file_tables(&tables);
-    print_settings();
-    print_tables(tables);
-    std::printf("\n");
+    if (report == check_report::full) {
+        std::printf("\n");
+        print_settings();
+        print_tables(tables);
+        std::printf("\n");
+    }
 
     int problems = print_table_problems(tables);
     if (src != 0 && problems == 0) {
@@ -233,4 +269,10 @@ int command_check_config(const command_line &line) {
         std::printf("VALID: the monitor would run with this control file\n");
     }
     return problems == 0 ? EXIT_OK : EXIT_FINDING;
+}
+
+int command_check_config(const command_line &line) {
+    int32_t interval = 0;
+    return check_control_file(line.operands.empty() ? nullptr : line.operands[0],
+                              check_report::full, &interval);
 }

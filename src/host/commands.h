@@ -2,6 +2,7 @@
 // tarnmon's one parser, and returns the process exit status.
 #pragma once
 
+#include <cstdint>
 #include <string_view>
 #include <vector>
 
@@ -20,6 +21,12 @@ inline constexpr int EXIT_NOT_FOUND = 127;      // there is no such program
 struct command_line {
     std::vector<const char *> operands;
     const char *file = nullptr; // --file PATH, for the commands that take it
+    // The options of `run`, as given; null when not given. --once takes no value: it holds the
+    // option's own word.
+    const char *interval = nullptr;
+    const char *data_dir = nullptr;
+    const char *config = nullptr;
+    const char *once = nullptr;
     // The limits of `limits`, in KB, as given; null when not given.
     const char *rss = nullptr;
     const char *dsiz = nullptr;
@@ -29,10 +36,11 @@ struct command_line {
     const char *vsize_abort = nullptr;
 };
 
-// An option that takes a value, and the field of command_line that tarnmon's parser puts it in.
+// An option, and the field of command_line that tarnmon's parser puts its value in. An option
+// without a placeholder takes no value: its field gets the option's own word.
 struct value_option {
     std::string_view name;        // "--rss"
-    std::string_view placeholder; // "KB", as the usage shows the value
+    std::string_view placeholder; // "KB", as the usage shows the value; empty: no value
     const char *command_line::*value;
 };
 
@@ -47,9 +55,23 @@ inline constexpr value_option LIMIT_OPTIONS[] = {
     {"--vsize-abort", "KB", &command_line::vsize_abort},
 };
 
+// How much of what it found check_control_file prints: the whole report of check-config, or only
+// the verdict that `run` gives before it starts the monitor.
+enum class check_report { full, verdict };
+
+// Reads a control file as the monitor reads it (the file at `path`, or telvzopt.trm through the
+// data-file service when `path` is null), parses and validates it with the monitor's own code, and
+// prints on standard output the name of the file, then each problem in a line that begins with
+// "PROBLEM:", or the line that begins with "VALID:". Nothing of the check reaches the monitor's
+// trace or event log. Returns check-config's exit status: EXIT_OK, EXIT_FINDING, or
+// EXIT_UNAVAILABLE when there is no file to read. Out: *checking_interval, the seconds between
+// passes that the file sets (60 when it sets none, or cannot be read).
+int check_control_file(const char *path, check_report report, int32_t *checking_interval);
+
 int command_status(const command_line &line);
 int command_stop(const command_line &line);
 int command_check_config(const command_line &line);
 int command_snapshots(const command_line &line);
 int command_limits(const command_line &line);
 int command_overrides(const command_line &line);
+int command_run(const command_line &line);

@@ -10,13 +10,19 @@
 namespace {
 
 constexpr value_option FILE_OPTION[] = {{"--file", "PATH", &command_line::file}};
+constexpr value_option RUN_OPTIONS[] = {
+    {"--interval", "SECONDS", &command_line::interval},
+    {"--data-dir", "DIR", &command_line::data_dir},
+    {"--config", "FILE", &command_line::config},
+    {"--once", "", &command_line::once},
+};
 constexpr std::span<const value_option> NO_OPTIONS;
 
 struct command {
     std::string_view name;
     int (*run)(const command_line &line);
-    std::span<const value_option> options; // the options that take a value
-    std::string_view arguments;            // what follows the options in its usage
+    std::span<const value_option> options;
+    std::string_view arguments; // what follows the options in its usage
     std::string_view summary;
     size_t max_operands;
     // The first operand and every word after it are a program and its arguments: they are the
@@ -40,6 +46,11 @@ constexpr command COMMANDS[] = {
      "COMMAND\n"},
     {"overrides", command_overrides, NO_OPTIONS, "",
      "list the memory limits that processes set for themselves", 0, false, ""},
+    {"run", command_run, RUN_OPTIONS, "",
+     "run the monitor here until SIGINT, SIGTERM or tarnmon stop (--once: one pass)", 0, false,
+     "run: 0 once the monitor has ended (its pass done, or stopped); check-config's status for a\n"
+     "control file that check-config refuses; 1 the monitor returned a failure of its own; 3 also\n"
+     "no data directory, no library, or the control block in use\n"},
 };
 
 constexpr const char *EXIT_STATUSES =
@@ -51,8 +62,10 @@ std::string synopsis(const command &c) {
     for (const auto &option : c.options) {
         text += " [";
         text += option.name;
-        text += ' ';
-        text += option.placeholder;
+        if (!option.placeholder.empty()) {
+            text += ' ';
+            text += option.placeholder;
+        }
         text += ']';
     }
     if (!c.arguments.empty()) {
@@ -112,6 +125,8 @@ parsed parse(const command &c, std::span<char *const> words, command_line *line)
             options = false;
         } else if (options && (word == "--help" || word == "-h")) {
             return parsed::help;
+        } else if (option != nullptr && option->placeholder.empty()) {
+            line->*option->value = words[i];
         } else if (option != nullptr && i + 1 < words.size()) {
             line->*option->value = words[++i];
         } else if (options && word.starts_with('-')) {
