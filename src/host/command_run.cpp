@@ -37,6 +37,7 @@
 #include "commands.h"
 #include "control_block_view.h"
 #include "core/control_file.h"
+#include "descriptor.h"
 #include "linux/environment.h"
 #include "snapshot_reader.h"
 
@@ -407,18 +408,6 @@ std::string file_of(const char *variable, const std::string &directory, const ch
     const char *chosen = std::getenv(variable);
     return chosen != nullptr && chosen[0] != '\0' ? chosen : directory + "/" + name;
 }
-
-struct descriptor {
-    explicit descriptor(int opened) : fd(opened) {}
-    descriptor(const descriptor &) = delete;
-    descriptor &operator=(const descriptor &) = delete;
-    ~descriptor() {
-        if (fd >= 0) {
-            ::close(fd);
-        }
-    }
-    const int fd;
-};
 
 const char *signal_name(uint32_t number) {
     return number == SIGINT ? "SIGINT" : number == SIGTERM ? "SIGTERM" : "a signal";

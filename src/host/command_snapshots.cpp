@@ -15,6 +15,7 @@
 #include "capture/snapshot_file.h"
 #include "commands.h"
 #include "data_blocks.h"
+#include "descriptor.h"
 #include "linux/environment.h"
 #include "snapshot_reader.h"
 
@@ -36,18 +37,6 @@ std::string default_path() {
 std::string cannot(const char *what, const std::string &path, int error) {
     return std::string("cannot ") + what + " " + path + ": " + std::strerror(error);
 }
-
-struct descriptor {
-    explicit descriptor(int opened) : fd(opened) {}
-    descriptor(const descriptor &) = delete;
-    descriptor &operator=(const descriptor &) = delete;
-    ~descriptor() {
-        if (fd >= 0) {
-            ::close(fd);
-        }
-    }
-    const int fd;
-};
 
 // The whole file; false with `problem` set when it cannot be read. Only a regular file within the
 // bound is read: a device or a pipe has no end, and a directory no text.
