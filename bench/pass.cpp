@@ -179,32 +179,6 @@ const command_spec FLOOR_COMMANDS[] = {
 
 void ignore_line(void *, char *, size_t) {}
 
-// One open, read and close of every /proc/<pid>/stat, from a scan of /proc.
-int bare_stat_reads() {
-    char text[4096];
-    int pids = 0;
-    DIR *directory = opendir("/proc/");
-    for (const dirent *found = directory != nullptr ? readdir(directory) : nullptr;
-         found != nullptr; found = readdir(directory)) {
-        int pid = std::atoi(found->d_name);
-        if (pid == 0) {
-            continue;
-        }
-        char path[64];
-        std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
-        int fd = open(path, O_RDONLY | O_CLOEXEC);
-        if (fd >= 0) {
-            benchmark::DoNotOptimize(read(fd, text, sizeof text - 1));
-            close(fd);
-        }
-        ++pids;
-    }
-    if (directory != nullptr) {
-        closedir(directory);
-    }
-    return pids;
-}
-
 // The floor of a pass; returns the processes whose stat it read.
 int run_floor() {
     for (const command_spec &command : FLOOR_COMMANDS) {

@@ -62,27 +62,9 @@ void update_process_list_per_pid(benchmark::State &state) {
 
 void bare_stat_reads_per_pid(benchmark::State &state) {
     idle.resize(static_cast<size_t>(state.range(0)));
-    char text[4096];
     int pids = 0;
     for (auto _ : state) {
-        pids = 0;
-        DIR *directory = opendir("/proc/");
-        for (const dirent *found = readdir(directory); found != nullptr;
-             found = readdir(directory)) {
-            int pid = std::atoi(found->d_name);
-            if (pid == 0) {
-                continue;
-            }
-            char path[64];
-            std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
-            int fd = open(path, O_RDONLY | O_CLOEXEC);
-            if (fd >= 0) {
-                benchmark::DoNotOptimize(read(fd, text, sizeof text - 1));
-                close(fd);
-            }
-            ++pids;
-        }
-        closedir(directory);
+        pids = bare_stat_reads();
     }
     report_per_pid(state, pids);
 }

@@ -60,3 +60,29 @@ int pids_in_proc() {
     }
     return count;
 }
+
+int bare_stat_reads() {
+    char text[4096];
+    int pids = 0;
+    DIR *directory = opendir("/proc/");
+    for (const dirent *found = directory != nullptr ? readdir(directory) : nullptr;
+         found != nullptr; found = readdir(directory)) {
+        int pid = std::atoi(found->d_name);
+        if (pid == 0) {
+            continue;
+        }
+        char path[64];
+        std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
+        int fd = open(path, O_RDONLY | O_CLOEXEC);
+        if (fd >= 0) {
+            ssize_t got = read(fd, text, sizeof text - 1);
+            __asm__ volatile("" : : "r"(got), "r"(text) : "memory"); // the read stays
+            close(fd);
+        }
+        ++pids;
+    }
+    if (directory != nullptr) {
+        closedir(directory);
+    }
+    return pids;
+}

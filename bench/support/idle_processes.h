@@ -23,3 +23,7 @@ class idle_processes {
 
 // The pids in /proc now.
 int pids_in_proc();
+
+// One open, read and close of every /proc/<pid>/stat, from a scan of /proc: the least that a
+// sample of every process's CPU time can cost. Returns the pids seen.
+int bare_stat_reads();
