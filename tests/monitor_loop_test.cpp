@@ -638,6 +638,31 @@ TEST_F(MonitorLoop, FullExtraIsInformationOnceAndNeverHoldsBackLaterReports) {
     EXPECT_EQ(extraFileSystemSRCOn, 1);
 }
 
+TEST_F(MonitorLoop, FullExtraIsReportedAgainAfterItWasBelowItsThreshold) {
+    write_control(control_text({}));
+    set_df(df_space(10, 95));
+    // Full, full (silent), below, full again; then a full "/" in the same pass as a full /extra
+    // is reported at once, since the information never set tookLog.
+    on_sleep = [this](int count) {
+        if (count == 10) {
+            set_df(df_space(10, 50));
+        }
+        if (count == 15) {
+            set_df(df_space(10, 95));
+        }
+        if (count == 20) {
+            set_df(df_space(95, 95));
+            TARN_CB_PTR->terminateRequest = 1;
+        }
+    };
+    run_monitor({"5"});
+    EXPECT_EQ(trace_indexes("TARNMNDF: inside while loop").size(), 5u);
+    EXPECT_EQ(events_of(RC_EXTRA_PARTITION_SPACE).size(), 2u);
+    ASSERT_EQ(events_of(SLASH_SPACE).size(), 1u);
+    EXPECT_EQ(events_of(SLASH_SPACE)[0]->record.option, LOGSVC_REPORT_ERROR + LOGSVC_DATA_ATTACHED);
+    EXPECT_EQ(rec::events().back().record.reason_code, SLASH_SPACE);
+}
+
 TEST_F(MonitorLoop, PlainSnapshotsComeAtTheirIntervalWithTrendAnalysisBeforeThem) {
     write_control(control_text({{"SNAPSHOT_INTERVAL", "3"}, {"TREND_ANALYSIS_POINTS", "2"}}));
     run_passes(9);
