@@ -297,6 +297,73 @@ TEST_F(PlatformCoreBlocks, ThreadsAllocatingAtOnceKeepEveryBlockApart) {
     EXPECT_EQ(telv::memdebug::live_blocks(), before);
 }
 
+// The anonymous memory this process holds resident, in kB, from /proc/self/status.
+long resident_anonymous_kb() {
+    for (const std::string &line : platform_test::read_lines("/proc/self/status")) {
+        if (line.starts_with("RssAnon:")) {
+            return std::strtol(line.c_str() + 8, nullptr, 10);
+        }
+    }
+    return -1;
+}
+
+// Whether a line of /proc/self/maps covers `address`.
+bool mapped(const void *address) {
+    auto at = reinterpret_cast<uintptr_t>(address);
+    for (const std::string &line : platform_test::read_lines("/proc/self/maps")) {
+        char *end = nullptr;
+        uintptr_t from = std::strtoull(line.c_str(), &end, 16);
+        uintptr_t to = std::strtoull(end + 1, nullptr, 16);
+        if (at >= from && at < to) {
+            return true;
+        }
+    }
+    return false;
+}
+
+TEST_F(PlatformCoreBlocks, ALargeBlockIsGivenBackToTheSystemWhenReleased) {
+    constexpr size_t SIZE = 16u << 20; // as a wrap of a snapshot file of 16 MB takes
+    long resident_before = resident_anonymous_kb();
+    auto *block = static_cast<unsigned char *>(telv::memdebug::allocate(SIZE, "snapshot_file", 1));
+    ASSERT_NE(block, nullptr);
+    EXPECT_EQ(reinterpret_cast<uintptr_t>(block) % alignof(std::max_align_t), 0u);
+    std::memset(block, 0x5A, SIZE);
+    EXPECT_GE(resident_anonymous_kb(), resident_before + static_cast<long>(SIZE >> 10) - 1024);
+    telv::memdebug::Block found{};
+    ASSERT_TRUE(telv::memdebug::find(block, &found));
+    EXPECT_EQ(found.size, SIZE);
+    telv::memdebug::release(block, "snapshot_file", 2);
+    EXPECT_FALSE(mapped(block));
+    EXPECT_FALSE(mapped(block + SIZE - 1));
+    EXPECT_LT(resident_anonymous_kb(), resident_before + 1024);
+}
+
+TEST_F(PlatformCoreBlocks, ALargeZeroedBlockIsZeroAndAWritePastItsEndFaults) {
+    constexpr size_t SIZE = telv::memdebug::LARGE_BLOCK + 5; // ends 11 bytes short of 16
+    auto *block =
+        static_cast<unsigned char *>(telv::memdebug::allocate_zeroed(1, SIZE, "snapshot_file", 1));
+    ASSERT_NE(block, nullptr);
+    size_t zero = 0;
+    for (size_t i = 0; i < SIZE; ++i) {
+        zero += block[i] == 0 ? 1 : 0;
+    }
+    EXPECT_EQ(zero, SIZE);
+    block[SIZE - 1] = 1;
+    size_t room = (SIZE + alignof(std::max_align_t) - 1) / alignof(std::max_align_t) *
+                  alignof(std::max_align_t);
+    volatile unsigned char *bytes = block;
+    bytes[room - 1] = 1; // the alignment's slack is still the block's page
+    EXPECT_DEATH(bytes[room] = 1, "");
+    telv::memdebug::release(block, "snapshot_file", 2);
+}
+
+TEST_F(PlatformCoreBlocks, ALargeBlockThatCannotBeMappedIsNull) {
+    size_t before = telv::memdebug::live_blocks();
+    EXPECT_EQ(telv::memdebug::allocate(SIZE_MAX - 8, "t", 1), nullptr);
+    EXPECT_EQ(telv::memdebug::allocate(size_t{1} << 62, "t", 1), nullptr);
+    EXPECT_EQ(telv::memdebug::live_blocks(), before);
+}
+
 TEST_F(PlatformCoreBlocks, LeakLinesAreOrderedByFileAndLine) {
     ASSERT_EQ(telv::memdebug::live_blocks(), 0u);
     void *blocks[] = {

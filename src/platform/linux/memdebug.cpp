@@ -6,6 +6,8 @@
 #include <cstring>
 #include <mutex>
 #include <new>
+#include <sys/mman.h>
+#include <unistd.h>
 #include <unordered_map>
 
 #include "environment.h"
@@ -27,8 +29,59 @@ Table &table() {
     return *t;
 }
 
-// Takes ownership of `block` into the table; null (and the block freed) when the table cannot
-// grow.
+// Where a large block lies in its own mapping: whole pages for it, then a guard page, with the
+// block ending at the guard.
+struct Placement {
+    size_t pages;  // the block's pages, the guard page not counted
+    size_t length; // of the mapping
+    size_t offset; // of the block from the start of the mapping
+    bool fits;     // false when the sizes pass size_t
+};
+
+Placement place(size_t size) {
+    static const size_t page = static_cast<size_t>(::sysconf(_SC_PAGESIZE));
+    constexpr size_t ALIGN = alignof(std::max_align_t); // as malloc aligns
+    size_t aligned = (size + ALIGN - 1) & ~(ALIGN - 1);
+    size_t pages = (aligned + page - 1) / page * page;
+    bool fits = aligned >= size && pages >= aligned && pages + page > pages;
+    return Placement{pages, pages + page, pages - aligned, fits};
+}
+
+// A block of `size` bytes, zeroed when `zeroed` (a fresh mapping always is).
+void *obtain(size_t size, bool zeroed) {
+    if (size < LARGE_BLOCK) {
+        size = std::max<size_t>(size, 1);
+        return zeroed ? std::calloc(size, 1) : std::malloc(size);
+    }
+    Placement at = place(size);
+    if (!at.fits) {
+        return nullptr;
+    }
+    void *start =
+        ::mmap(nullptr, at.length, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    if (start == MAP_FAILED) {
+        return nullptr;
+    }
+    auto *bytes = static_cast<char *>(start);
+    if (::mprotect(bytes + at.pages, at.length - at.pages, PROT_NONE) != 0) {
+        ::munmap(start, at.length);
+        return nullptr;
+    }
+    return bytes + at.offset;
+}
+
+// Gives back a block of `obtain`, of the size it was asked for.
+void give_back(void *block, size_t size) {
+    if (size < LARGE_BLOCK) {
+        std::free(block);
+        return;
+    }
+    Placement at = place(size);
+    ::munmap(static_cast<char *>(block) - at.offset, at.length);
+}
+
+// Takes ownership of `block` into the table; null (and the block given back) when the table
+// cannot grow.
 void *remember(void *block, size_t size, const char *file, int line) {
     if (block == nullptr) {
         return nullptr;
@@ -41,7 +94,7 @@ void *remember(void *block, size_t size, const char *file, int line) {
     try {
         t.blocks.emplace(block, entry);
     } catch (const std::bad_alloc &) {
-        std::free(block);
+        give_back(block, size);
         block = nullptr;
     }
     return block;
@@ -62,7 +115,7 @@ __attribute__((destructor)) void report_at_exit() {
 } // namespace
 
 void *allocate(size_t size, const char *file, int line) {
-    return remember(std::malloc(std::max<size_t>(size, 1)), size, file, line);
+    return remember(obtain(size, false), size, file, line);
 }
 
 void *allocate_zeroed(size_t count, size_t size, const char *file, int line) {
@@ -70,7 +123,7 @@ void *allocate_zeroed(size_t count, size_t size, const char *file, int line) {
         return nullptr;
     }
     size_t total = count * size;
-    return remember(std::calloc(std::max<size_t>(total, 1), 1), total, file, line);
+    return remember(obtain(total, true), total, file, line);
 }
 
 void release(void *ptr, const char *file, int line) {
@@ -78,13 +131,19 @@ void release(void *ptr, const char *file, int line) {
         return;
     }
     bool known = false;
+    size_t size = 0;
     {
         Table &t = table();
         std::lock_guard guard(t.lock);
-        known = t.blocks.erase(ptr) == 1;
+        auto entry = t.blocks.find(ptr);
+        if (entry != t.blocks.end()) {
+            known = true;
+            size = entry->second.size;
+            t.blocks.erase(entry);
+        }
     }
     if (known) {
-        std::free(ptr);
+        give_back(ptr, size);
     } else {
         trace::line("TELVMEMF: free of %p from %s:%d, which is no live block", ptr,
                     file != nullptr ? file : "?", line);

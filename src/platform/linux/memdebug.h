@@ -1,5 +1,10 @@
 // The debugging allocator of the default platform: every live block is known with its size and
 // the source file and line that took it, so that what is still live at exit can be named.
+//
+// A block of LARGE_BLOCK bytes or more (the snapshot file's wrap takes the whole file, megabytes,
+// once in a while) is mapped on its own and unmapped when released: the host's heap would keep
+// such a block resident for good once it had been freed. It ends right before a page that may not
+// be touched, so that a write past its end faults where it happens.
 #pragma once
 
 #include <cstddef>
@@ -13,6 +18,7 @@ inline constexpr const char *REPORT_VARIABLE = "TELV_MEMDEBUG_REPORT";
 // Longest file name kept; a longer one is cut. The name is copied, since the module that named it
 // may be unloaded before the block is reported.
 inline constexpr size_t MAX_FILE = 63;
+inline constexpr size_t LARGE_BLOCK = 1u << 20;
 
 struct Block {
     size_t size;
