@@ -387,6 +387,26 @@ TEST_F(PlatformCoreBlocks, LeakLinesAreOrderedByFileAndLine) {
     EXPECT_TRUE(telv::memdebug::leak_lines().empty());
 }
 
+using PlatformCoreWaitingLines = platform_test::PlatformTest;
+
+TEST_F(PlatformCoreWaitingLines, DetailLinesWaitingAreWrittenWhenAsked) {
+    telv::trace::line("TARNWATD: waits");
+    EXPECT_EQ(platform_test::file_size(trace_path()), -1);
+    EXPECT_TRUE(telv::trace::write_waiting_lines());
+    std::vector<std::string> lines = platform_test::read_lines(trace_path());
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_TRUE(lines[0].ends_with(" TARNWATD: waits"));
+    EXPECT_TRUE(telv::trace::write_waiting_lines()); // nothing waits: nothing to fail
+}
+
+TEST_F(PlatformCoreWaitingLines, WaitingLinesThatCannotBeWrittenAreSaidToFail) {
+    set_variable("TELV_TRACE_FILE", dir + "/missing/directory/telvzmnd.trace");
+    EXPECT_GT(telv::trace::line("TARNWATD: waits"), 0);
+    EXPECT_FALSE(telv::trace::write_waiting_lines());
+    EXPECT_TRUE(telv::trace::write_waiting_lines()); // they are gone, not tried again
+    ::unsetenv("TELV_TRACE_FILE");
+}
+
 TEST(PlatformCoreModuleNames, AModuleIsItsSharedLibrary) {
     EXPECT_EQ(telv::modules::library_name(MODSVC_MONITOR_MODULE), "libtelvzmnd.so");
     EXPECT_EQ(telv::modules::library_name("telvtestmodule"), "libtelvtestmodule.so");

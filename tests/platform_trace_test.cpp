@@ -730,4 +730,115 @@ TEST_F(PlatformTrace, ThreadsRotatingTheFileKeepWholeLinesWithinTheBound) {
     EXPECT_GT(file_size(trace_path() + ".1"), 3000 - 200);
 }
 
+// ---- Detail lines wait to be written together ----
+
+// As the platform promises: at most this many bytes wait, and no longer than this.
+constexpr long WAITING_BYTES = 64 << 10;
+constexpr int WAIT_AT_MOST_MS = 100;
+
+TEST_F(PlatformTrace, DetailLinesWaitForTheNextLineThatIsNone) {
+    EXPECT_EQ(tracesvc_trace("TARNWATD: first %d", 1), 17);
+    tracesvc_trace("TARNWATD: second");
+    EXPECT_EQ(file_size(trace_path()), -1);
+    tracesvc_trace("TARNWATF: flow");
+    std::vector<std::string> expected = {"TARNWATD: first 1", "TARNWATD: second", "TARNWATF: flow"};
+    EXPECT_EQ(texts(trace_path()), expected);
+}
+
+// Lines that would pass the batch go out first, whole: the file then holds the lines before the
+// one that did not fit, no more than a batch of them, and no less than a batch less one line.
+TEST_F(PlatformTrace, WaitingLinesGoOutBeforeTheLineThatWouldPassTheBatch) {
+    std::string text = padded("TARNBATD: ", 1000);
+    int traced = 0;
+    while (file_size(trace_path()) <= 0 && traced < 1000) {
+        tracesvc_trace("%s", text.c_str());
+        ++traced;
+    }
+    long written = file_size(trace_path());
+    EXPECT_LE(written, WAITING_BYTES);
+    EXPECT_GT(written, WAITING_BYTES - 1100);
+    std::vector<std::string> lines = texts(trace_path());
+    EXPECT_EQ(lines.size(), static_cast<size_t>(traced - 1));
+    EXPECT_EQ(lines.back(), text);
+}
+
+TEST_F(PlatformTrace, AWaitingLineGoesOutWhenTheNextComesLate) {
+    tracesvc_trace("TARNLATD: early");
+    ::usleep((WAIT_AT_MOST_MS + 20) * 1000);
+    tracesvc_trace("TARNLATD: late");
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNLATD: early"});
+}
+
+TEST_F(PlatformTrace, WaitingLinesGoToTheFileTheyWereTracedTo) {
+    std::string first = dir + "/first.trace";
+    std::string second = dir + "/second.trace";
+    set_variable("TELV_TRACE_FILE", first);
+    tracesvc_trace("TARNTGTD: to the first");
+    set_variable("TELV_TRACE_FILE", second);
+    tracesvc_trace("TARNTGTD: to the second");
+    EXPECT_EQ(texts(first), std::vector<std::string>{"TARNTGTD: to the first"});
+    EXPECT_EQ(file_size(second), -1);
+    ::unsetenv("TELV_TRACE_FILE");
+    tracesvc_trace("TARNTGTF: to the default");
+    EXPECT_EQ(texts(second), std::vector<std::string>{"TARNTGTD: to the second"});
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNTGTF: to the default"});
+}
+
+// A changed bound is another target too: what waits is no more than the bound it was traced under.
+TEST_F(PlatformTrace, ABatchIsNeverLargerThanTheBoundAndRotatesTheFileWhole) {
+    set_variable("TELV_TRACE_MAX_BYTES", "1000");
+    std::vector<std::string> traced;
+    for (int i = 0; i < 40; ++i) {
+        traced.push_back(padded("TARNRTBD: line " + std::to_string(i) + " ", 60));
+        tracesvc_trace("%s", traced.back().c_str());
+    }
+    traced.push_back("TARNRTBF: flow");
+    tracesvc_trace("%s", traced.back().c_str());
+    EXPECT_LE(file_size(trace_path()), 1000);
+    EXPECT_LE(file_size(trace_path() + ".1"), 1000);
+    EXPECT_GT(file_size(trace_path() + ".1"), 1000 - 2 * 100);
+    std::vector<std::string> last = texts(trace_path());
+    std::vector<std::string> before = texts(trace_path() + ".1");
+    ASSERT_FALSE(before.empty());
+    ASSERT_FALSE(last.empty());
+    EXPECT_TRUE(std::equal(last.rbegin(), last.rend(), traced.rbegin())); // the newest lines
+    EXPECT_EQ(before.back(), traced[traced.size() - last.size() - 1]);    // right before them
+}
+
+TEST_F(PlatformTrace, ADetailDumpWaitsAndAnotherIsWrittenWholeAtItsEnd) {
+    EXPECT_EQ(tracesvc_dump_bytes("TARNDMPD: detail dump", "abc", 3), 0);
+    EXPECT_EQ(file_size(trace_path()), -1);
+    EXPECT_EQ(tracesvc_dump_bytes("TARNDMPF: flow dump", "xyz", 3), 0);
+    std::string row = std::string(1 + 13 * 3 + 1 + 1, ' ');
+    std::vector<std::string> expected = {
+        "TARNDMPD: detail dump",
+        "00000000  61 62 63" + row + "|abc|",
+        "TARNDMPF: flow dump",
+        "00000000  78 79 7A" + row + "|xyz|",
+    };
+    EXPECT_EQ(texts(trace_path()), expected);
+}
+
+TEST_F(PlatformTrace, WaitingLinesAreWrittenWhenTheProcessEnds) {
+    pid_t child = ::fork();
+    if (child == 0) {
+        tracesvc_trace("TARNENDD: written at exit");
+        std::exit(0); // not _exit: the process ends the way a host's does
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(texts(trace_path()), std::vector<std::string>{"TARNENDD: written at exit"});
+}
+
+// The child of a fork leaves what was waiting to its parent: written once, by the parent.
+TEST_F(PlatformTrace, AForkedChildLeavesTheWaitingLinesToItsParent) {
+    tracesvc_trace("TARNFWTD: waiting at the fork");
+    ASSERT_TRUE(in_child([] { return tracesvc_trace("TARNFWTF: child") > 0; }));
+    tracesvc_trace("TARNFWTF: parent");
+    std::vector<std::string> expected = {"TARNFWTF: child", "TARNFWTD: waiting at the fork",
+                                         "TARNFWTF: parent"};
+    EXPECT_EQ(texts(trace_path()), expected);
+}
+
 } // namespace

@@ -163,6 +163,13 @@ struct Sink {
     // Paths already said in the trace to be past their bound and not rotated: once a process is
     // enough (a forked child inherits what its parent has said).
     std::set<std::string> said_unrotated;
+    // Detail lines waiting to be written together, composed, with the target they were traced to.
+    char waiting[WAITING_BYTES];
+    size_t waiting_length = 0;
+    int64_t waiting_since_ms = 0;
+    std::string waiting_file;
+    std::string waiting_data_directory;
+    uint64_t waiting_max_bytes = 0;
 };
 
 // Made as the library loads, as is all that is made once here: a fork that came while another
@@ -172,9 +179,13 @@ Sink *const sink = new Sink;
 
 // A child forked while another thread is inside a line would find the lock held for ever; the
 // fork waits for the line instead.
+// The child leaves the lines still waiting to its parent, which writes them.
 [[maybe_unused]] const bool lines_end_before_a_fork =
     ::pthread_atfork([] { sink->lock.lock(); }, [] { sink->lock.unlock(); },
-                     [] { sink->lock.unlock(); }) == 0;
+                     [] {
+                         sink->waiting_length = 0;
+                         sink->lock.unlock();
+                     }) == 0;
 
 void close_sink(Sink &s) {
     if (s.fd >= 0) {
@@ -208,6 +219,12 @@ struct Target {
                path.ends_with(name);
     }
 };
+
+// The most that waits to be written at once: no more than the bound, so that a file rotated for
+// the lines waiting takes them whole.
+size_t batch_bytes(const Target &target) {
+    return static_cast<size_t>(std::min<uint64_t>(WAITING_BYTES, target.max_bytes));
+}
 
 constexpr const char *TARGET_VARIABLES[] = {FILE_VARIABLE, environment::DATA_DIR_VARIABLE,
                                             MAX_BYTES_VARIABLE, DETAIL_VARIABLE};
@@ -477,15 +494,13 @@ int64_t milliseconds_of(const struct timespec &time) {
     return static_cast<int64_t>(time.tv_sec) * 1000 + time.tv_nsec / 1000000;
 }
 
-// Stamps, composes and appends one line; the caller holds the sink's lock.
-bool emit(Sink &s, const Target &target, std::string_view text) {
-    stamp::LineStamp stamp = stamp::line_stamp();
-    char line[MAX_LINE];
-    size_t room = static_cast<size_t>(std::min<uint64_t>(sizeof line, target.max_bytes));
-    size_t length = compose(line, room, std::string_view(stamp.text, stamp.length), text);
-    Outcome outcome = append(s, target, milliseconds_of(stamp.time), line, length);
-    // A reader who finds the file past its bound learns why, once. The note is a line past the
-    // bound too, but by then the path has been said.
+bool emit(Sink &s, const Target &target, std::string_view text, bool may_wait);
+
+// Appends composed lines, and says once when they went past the bound of a file that is not
+// rotated: a reader who finds the file past its bound learns why. The note is a line past the
+// bound too, but by then the path has been said.
+bool write_out(Sink &s, const Target &target, int64_t now_ms, const char *lines, size_t length) {
+    Outcome outcome = append(s, target, now_ms, lines, length);
     if (outcome == Outcome::written_past_bound && s.said_unrotated.insert(s.path).second) {
         char note[MAX_LINE];
         int note_length =
@@ -493,9 +508,57 @@ bool emit(Sink &s, const Target &target, std::string_view text) {
                           "TELVTRCF: trace file %s is not a regular file: it is not rotated and "
                           "grows past its bound of %llu bytes",
                           s.path.c_str(), static_cast<unsigned long long>(target.max_bytes));
-        emit(s, target, printed(note, sizeof note, note_length));
+        emit(s, target, printed(note, sizeof note, note_length), false);
     }
     return outcome != Outcome::failed;
+}
+
+// Writes the lines waiting, if any, to the target they were traced to.
+bool write_waiting(Sink &s, int64_t now_ms) {
+    if (s.waiting_length == 0) {
+        return true;
+    }
+    Target target{s.waiting_file, s.waiting_data_directory, s.waiting_max_bytes, true};
+    size_t length = s.waiting_length;
+    s.waiting_length = 0;
+    return write_out(s, target, now_ms, s.waiting, length);
+}
+
+// Whether the lines waiting must be written before a line traced at `now_ms` to `target`: they
+// were traced elsewhere, the line does not wait or would not fit with them, or they are old.
+bool waiting_must_go(const Sink &s, const Target &target, int64_t now_ms, size_t length,
+                     bool may_wait) {
+    bool elsewhere = target.file != s.waiting_file ||
+                     target.data_directory != s.waiting_data_directory ||
+                     target.max_bytes != s.waiting_max_bytes;
+    return s.waiting_length > 0 &&
+           (!may_wait || elsewhere || s.waiting_length + length > batch_bytes(target) ||
+            now_ms < s.waiting_since_ms || now_ms - s.waiting_since_ms >= WAIT_AT_MOST_MS);
+}
+
+// Stamps and composes one line, and appends it, or lets it wait with the lines before it when
+// `may_wait`. The caller holds the sink's lock.
+bool emit(Sink &s, const Target &target, std::string_view text, bool may_wait) {
+    stamp::LineStamp stamp = stamp::line_stamp();
+    int64_t now_ms = milliseconds_of(stamp.time);
+    char line[MAX_LINE];
+    size_t room = static_cast<size_t>(std::min<uint64_t>(sizeof line, target.max_bytes));
+    size_t length = compose(line, room, std::string_view(stamp.text, stamp.length), text);
+    if (waiting_must_go(s, target, now_ms, length, may_wait)) {
+        write_waiting(s, now_ms); // lost when it fails; this line is still tried
+    }
+    if (!may_wait) {
+        return write_out(s, target, now_ms, line, length);
+    }
+    if (s.waiting_length == 0) {
+        s.waiting_since_ms = now_ms;
+        s.waiting_file = target.file;
+        s.waiting_data_directory = target.data_directory;
+        s.waiting_max_bytes = target.max_bytes;
+    }
+    std::memcpy(s.waiting + s.waiting_length, line, length);
+    s.waiting_length += length;
+    return true;
 }
 
 // Where the next line end ('\n' or '\r') of `text` lies; its size when there is none.
@@ -511,6 +574,19 @@ size_t next_line_end(std::string_view text) {
     return static_cast<size_t>(first - text.data());
 }
 
+} // namespace
+
+bool write_waiting_lines() {
+    Sink &s = *sink;
+    std::lock_guard guard(s.lock);
+    return write_waiting(s, milliseconds_of(stamp::line_stamp().time));
+}
+
+namespace {
+// The lines still waiting when the process ends, or the platform is unloaded, are written then.
+__attribute__((destructor)) void write_waiting_at_exit() {
+    write_waiting_lines();
+}
 } // namespace
 
 bool is_detail(std::string_view text) {
@@ -581,7 +657,7 @@ int vline(const char *format, va_list args) {
     }
     Sink &s = *sink;
     std::lock_guard guard(s.lock);
-    return emit(s, target, kept) ? length : -1;
+    return emit(s, target, kept, is_detail(kept)) ? length : -1;
 }
 
 int line(const char *format, ...) {
@@ -598,9 +674,10 @@ int dump(const char *title, const void *data, uint32_t length) {
     if (!target.detail && is_detail(heading)) {
         return 0;
     }
+    // The rows wait with their title, and a dump that is no detail goes out whole at its end.
     Sink &s = *sink;
     std::lock_guard guard(s.lock);
-    bool written = emit(s, target, heading);
+    bool written = emit(s, target, heading, true);
     const auto *bytes = static_cast<const unsigned char *>(data);
     // 64 bits: the offset of the row after the last one may pass 32 bits.
     for (uint64_t offset = 0; written && bytes != nullptr && offset < length;
@@ -609,7 +686,10 @@ int dump(const char *title, const void *data, uint32_t length) {
         size_t count = std::min<uint64_t>(DUMP_BYTES_PER_ROW, length - offset);
         size_t row_length =
             dump_row(row, sizeof row, static_cast<uint32_t>(offset), bytes + offset, count);
-        written = emit(s, target, std::string_view(row, row_length));
+        written = emit(s, target, std::string_view(row, row_length), true);
+    }
+    if (!is_detail(heading)) {
+        written = write_waiting(s, milliseconds_of(stamp::line_stamp().time)) && written;
     }
     return written && (bytes != nullptr || length == 0) ? 0 : -1;
 }

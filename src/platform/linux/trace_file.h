@@ -9,6 +9,13 @@
 // every LOOK_EVERY_LINES lines or LOOK_EVERY_MS milliseconds; until then the lines go with the
 // file. Any other path, or a file whose shared state cannot be had, is looked at for every line,
 // under flock. The state file is the writers' own: cut short under them, it stops them (SIGBUS).
+//
+// Detail lines are many (a pass traces a line for every descriptor it lists) and a write each was
+// most of their cost, so they wait, composed and stamped, to be written together: before the next
+// line that is no detail line, once WAITING_BYTES (at most the bound) would be passed, when the
+// first has waited WAIT_AT_MOST_MS by the time of the next line, and when the process ends. A
+// detail line that waits counts as written; one lost with its batch is not told to its caller,
+// nor is a batch still waiting when the process is killed. A dump is written whole, with its rows.
 #pragma once
 
 #include <cstdarg>
@@ -28,6 +35,8 @@ inline constexpr size_t MAX_LINE = 8192;
 inline constexpr size_t DUMP_BYTES_PER_ROW = 16;
 inline constexpr uint32_t LOOK_EVERY_LINES = 1000;
 inline constexpr int64_t LOOK_EVERY_MS = 100;
+inline constexpr size_t WAITING_BYTES = 64u << 10;
+inline constexpr int64_t WAIT_AT_MOST_MS = 100;
 
 // A detail line: its eye-catcher (the first nine characters, "TARNSDAD:") has 'D' as the eighth.
 bool is_detail(std::string_view text);
@@ -48,5 +57,8 @@ int line(const char *format, ...) __attribute__((format(printf, 1, 2)));
 
 // A title line, then the rows of the dump; 0, or -1 when the trace file could not be written.
 int dump(const char *title, const void *data, uint32_t length);
+
+// Writes the detail lines waiting now; false when they could not be written.
+bool write_waiting_lines();
 
 } // namespace telv::trace
