@@ -12,6 +12,7 @@
 #include <string>
 #include <vector>
 
+#include "example_control_file.h"
 #include "platform_test_support.h"
 
 namespace {
@@ -21,24 +22,6 @@ using platform_test::ChildResult;
 std::string env(const char *name) {
     const char *value = std::getenv(name);
     return value != nullptr ? value : "";
-}
-
-std::string example_text() {
-    return platform_test::read_file(env("TARN_SOURCE_DIR") + "/examples/telvzopt.trm");
-}
-
-// The example with the line that begins with `keyword` replaced by `replacement` (removed when
-// empty).
-std::string example_with(const std::string &keyword, const std::string &replacement) {
-    std::string text = example_text();
-    size_t at = text.find("\n" + keyword + " ");
-    if (at == std::string::npos) {
-        at = text.find("\n" + keyword + "\n");
-    }
-    EXPECT_NE(at, std::string::npos) << keyword;
-    size_t end = text.find('\n', at + 1);
-    text.replace(at + 1, end - at, replacement.empty() ? "" : replacement + "\n");
-    return text;
 }
 
 class CheckConfig : public platform_test::PlatformTest {
@@ -81,7 +64,7 @@ std::string setting_line(const char *keyword, const char *value, const char *uni
 }
 
 TEST_F(CheckConfig, PrintsEverySettingWithItsUnit) {
-    ChildResult result = check_text(example_text());
+    ChildResult result = check_text(example::text());
     ASSERT_EQ(result.exit_status, 0) << result.out;
     EXPECT_TRUE(contains(result.out, "Settings:\n" + setting_line("ACTUALLY_RUN", "1",
                                                                   "1 = the monitor runs (the "
@@ -114,7 +97,7 @@ TEST_F(CheckConfig, PrintsEverySettingWithItsUnit) {
 }
 
 TEST_F(CheckConfig, ShowsTheValuesMonitoringStartsWith) {
-    std::string text = example_with("CHECKING_INTERVAL", "");
+    std::string text = example::with("CHECKING_INTERVAL", "");
     text = text.substr(0, text.find("TREND_ANALYSIS_NUM_INCREASES")) +
            text.substr(text.find("MAX_SNAPSHOT_FILE_SIZE"));
     ChildResult result = check_text(text);
@@ -128,7 +111,7 @@ TEST_F(CheckConfig, ShowsTheValuesMonitoringStartsWith) {
 }
 
 TEST_F(CheckConfig, WithoutFileReadsTheDataDirectory) {
-    write("telvzopt.trm", example_text());
+    write("telvzopt.trm", example::text());
     ChildResult result = check({});
     EXPECT_EQ(result.exit_status, 0) << result.out;
     EXPECT_TRUE(contains(result.out, "Control file: telvzopt.trm in the data directory " + dir))
@@ -183,7 +166,7 @@ TEST_F(CheckConfig, EmptyFile) {
 }
 
 TEST_F(CheckConfig, ActuallyRunMissing) {
-    ChildResult result = check_text(example_with("ACTUALLY_RUN", ""));
+    ChildResult result = check_text(example::with("ACTUALLY_RUN", ""));
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "PROBLEM: ACTUALLY_RUN is missing; the monitor runs only "
                                      "when the file holds a line starting with it\n"))
@@ -192,7 +175,7 @@ TEST_F(CheckConfig, ActuallyRunMissing) {
 }
 
 TEST_F(CheckConfig, ExpressionThatDoesNotCompileIsNamed) {
-    std::string text = example_text() + "PROCESS_LOG_THRESHOLDS 1 2 3 1 [abc\n";
+    std::string text = example::text() + "PROCESS_LOG_THRESHOLDS 1 2 3 1 [abc\n";
     ChildResult result = check_text(text);
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "the process name expression [[abc] of "
@@ -205,7 +188,7 @@ TEST_F(CheckConfig, ExpressionThatDoesNotCompileIsNamed) {
 }
 
 TEST_F(CheckConfig, AbortExpressionThatDoesNotCompileIsNamedWithItsLine) {
-    std::string text = "PROCESS_ABORT_THRESHOLDS 1 2 3 a\\{1\n" + example_text();
+    std::string text = "PROCESS_ABORT_THRESHOLDS 1 2 3 a\\{1\n" + example::text();
     ChildResult result = check_text(text);
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "PROBLEM: line 1: the process name expression [a\\{1] of "
@@ -214,8 +197,8 @@ TEST_F(CheckConfig, AbortExpressionThatDoesNotCompileIsNamedWithItsLine) {
 }
 
 TEST_F(CheckConfig, RoutineThatCannotBeResolved) {
-    std::string text = example_with("EXTERNAL_CHECKING_ROUTINE",
-                                    "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_no_such_check");
+    std::string text = example::with("EXTERNAL_CHECKING_ROUTINE",
+                                     "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_no_such_check");
     ChildResult result = check_text(text);
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "the routine tarn_no_such_check of module telvzmnd cannot "
@@ -230,7 +213,7 @@ TEST_F(CheckConfig, RoutineThatCannotBeResolved) {
 
 TEST_F(CheckConfig, RuleThatFailsIsNamedWithValueRuleAndUnit) {
     ChildResult result =
-        check_text(example_with("VSZ_MEMORY_THRESHOLD", "VSZ_MEMORY_THRESHOLD 10"));
+        check_text(example::with("VSZ_MEMORY_THRESHOLD", "VSZ_MEMORY_THRESHOLD 10"));
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "PROBLEM: VSZ_MEMORY_THRESHOLD is 10 (KB of a process's "
                                      "virtual size), but it must be at least 11; the monitor "
@@ -240,7 +223,7 @@ TEST_F(CheckConfig, RuleThatFailsIsNamedWithValueRuleAndUnit) {
 
 TEST_F(CheckConfig, CrossRuleNamesTheOtherSetting) {
     ChildResult result =
-        check_text(example_with("RESUME_JAVA_LOG_ON_PERCENT", "RESUME_JAVA_LOG_ON_PERCENT 50"));
+        check_text(example::with("RESUME_JAVA_LOG_ON_PERCENT", "RESUME_JAVA_LOG_ON_PERCENT 50"));
     EXPECT_EQ(result.exit_status, 1);
     EXPECT_TRUE(contains(result.out, "PROBLEM: RESUME_JAVA_LOG_ON_PERCENT is 50 (percent (x10) "
                                      "of free Java heap), but it must be from 11 to 1000 and "
@@ -250,7 +233,7 @@ TEST_F(CheckConfig, CrossRuleNamesTheOtherSetting) {
 }
 
 TEST_F(CheckConfig, OnlyTheFirstFailingRuleIsNamed) {
-    std::string text = example_with("LOW_FREE_SIZE", "LOW_FREE_SIZE 0");
+    std::string text = example::with("LOW_FREE_SIZE", "LOW_FREE_SIZE 0");
     size_t at = text.find("NUM_THREADS_THRESHOLD 2000");
     ASSERT_NE(at, std::string::npos);
     text.replace(at, 26, "NUM_THREADS_THRESHOLD 5");
@@ -261,7 +244,7 @@ TEST_F(CheckConfig, OnlyTheFirstFailingRuleIsNamed) {
 }
 
 TEST_F(CheckConfig, TextBeyond100000BytesIsNotRead) {
-    std::string text = example_text();
+    std::string text = example::text();
     while (text.size() < 100000) {
         text += "* padding that the monitor reads and passes over\n";
     }
@@ -294,7 +277,7 @@ TEST_F(CheckConfig, OptionsAndADashAreNoFileNames) {
 }
 
 TEST_F(CheckConfig, AFileNameBeginningWithADashFollowsTheEndOfOptions) {
-    write("-name", example_text());
+    write("-name", example::text());
     std::filesystem::path here = std::filesystem::current_path();
     std::filesystem::current_path(dir);
     ChildResult result = check({"--", "-name"});
@@ -305,9 +288,9 @@ TEST_F(CheckConfig, AFileNameBeginningWithADashFollowsTheEndOfOptions) {
 
 // Bytes of the file that would drive a terminal: a title change ended by BEL, a screen clear.
 TEST_F(CheckConfig, ControlBytesOfTheFileAreShownEscaped) {
-    std::string text = example_with("EXTERNAL_CHECKING_ROUTINE",
-                                    "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_\x1b[2J\x07"
-                                    "check");
+    std::string text = example::with("EXTERNAL_CHECKING_ROUTINE",
+                                     "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_\x1b[2J\x07"
+                                     "check");
     text += "PROCESS_LOG_THRESHOLDS 1 2 3 1 \x1b]0;owned\x07\n";
     text += "PROCESS_ABORT_THRESHOLDS 1 2 3 \x1b[2J\n"; // an open bracket: does not compile
     ChildResult result = check_text(text);
@@ -329,7 +312,7 @@ TEST_F(CheckConfig, ControlBytesOfTheFileAreShownEscaped) {
 
 // A check leaves the data directory of the running monitor as it found it.
 TEST_F(CheckConfig, AnExplicitFileCreatesNoDataDirectory) {
-    std::string candidate = write("candidate.trm", example_text());
+    std::string candidate = write("candidate.trm", example::text());
     std::string absent = dir + "/data";
     platform_test::set_variable("TELV_DATA_DIR", absent);
     ChildResult result = check({candidate});
@@ -343,9 +326,9 @@ TEST_F(CheckConfig, TheMonitorsTraceIsLeftAlone) {
     platform_test::set_variable("TELV_DATA_DIR", data);
     std::string trace = "2021-03-05T07:04:09Z 4711 4711 TARNMNDF: a line of the running monitor\n";
     std::ofstream(data + "/telvzmnd.trace", std::ios::binary) << trace;
-    std::ofstream(data + "/telvzopt.trm", std::ios::binary) << example_text();
+    std::ofstream(data + "/telvzopt.trm", std::ios::binary) << example::text();
 
-    EXPECT_EQ(check({write("candidate.trm", example_text())}).exit_status, 0);
+    EXPECT_EQ(check({write("candidate.trm", example::text())}).exit_status, 0);
     EXPECT_EQ(check({}).exit_status, 0); // the monitor's own control file, read its way
     EXPECT_EQ(platform_test::read_file(data + "/telvzmnd.trace"), trace);
     std::vector<std::string> names;

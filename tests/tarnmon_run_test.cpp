@@ -27,6 +27,7 @@
 #include <vector>
 
 #include "core/control_block.h"
+#include "example_control_file.h"
 #include "fake_commands.h"
 #include "private_ipc.h"
 #include "run_command.h"
@@ -52,10 +53,6 @@ std::string tarnmon() {
     return env("TARN_BUILD_DIR") + "/tarnmon";
 }
 
-std::string example_path() {
-    return env("TARN_SOURCE_DIR") + "/examples/telvzopt.trm";
-}
-
 std::string read_file(const std::string &path) {
     std::ifstream in(path, std::ios::binary);
     std::ostringstream text;
@@ -66,20 +63,6 @@ std::string read_file(const std::string &path) {
 void write_file(const std::string &path, const std::string &text) {
     std::ofstream out(path, std::ios::binary | std::ios::trunc);
     out << text;
-}
-
-// The example with the line that begins with `keyword` replaced by `replacement` (removed when
-// empty).
-std::string example_with(const std::string &keyword, const std::string &replacement) {
-    std::string text = read_file(example_path());
-    size_t at = text.find("\n" + keyword + " ");
-    if (at == std::string::npos) {
-        at = text.find("\n" + keyword + "\n");
-    }
-    EXPECT_NE(at, std::string::npos) << keyword;
-    size_t end = text.find('\n', at + 1);
-    text.replace(at + 1, end - at, replacement.empty() ? "" : replacement + "\n");
-    return text;
 }
 
 int count_of(const std::string &text, const std::string &part) {
@@ -302,15 +285,15 @@ const std::string RUN_USAGE =
 // ---- One pass ----
 
 TEST_F(TarnmonRun, OnceOnAQuietHostWritesAPlainSnapshotAndNoEvent) {
-    std::string example = read_file(example_path());
-    running_tarnmon monitor({"--once", "--config", example_path()});
+    std::string example = read_file(example::path());
+    running_tarnmon monitor({"--once", "--config", example::path()});
     command_result r;
     r.status = monitor.wait(PASS_LIMIT);
     r.out = monitor.out();
     r.err = monitor.err();
     EXPECT_EQ(r.status, 0) << r.out << r.err;
     std::string build = real_path(env("TARN_BUILD_DIR"));
-    EXPECT_EQ(r.out, "Control file: " + example_path() + " (" + std::to_string(example.size()) +
+    EXPECT_EQ(r.out, "Control file: " + example::path() + " (" + std::to_string(example.size()) +
                          " bytes read)\n"
                          "VALID: the monitor would run with this control file\n"
                          "monitor: " +
@@ -342,12 +325,12 @@ TEST_F(TarnmonRun, OnceOnAQuietHostWritesAPlainSnapshotAndNoEvent) {
     // The control file was the user's, through a link that is gone again.
     EXPECT_FALSE(
         std::filesystem::exists(std::filesystem::symlink_status(data_dir + "/telvzopt.trm")));
-    EXPECT_EQ(read_file(example_path()), example);
+    EXPECT_EQ(read_file(example::path()), example);
 }
 
 TEST_F(TarnmonRun, ControlFileOfTheDataDirectoryIsReadWithoutConfig) {
     write_file(data_dir + "/telvzopt.trm",
-               example_with("CHECKING_INTERVAL", "CHECKING_INTERVAL 30"));
+               example::with("CHECKING_INTERVAL", "CHECKING_INTERVAL 30"));
     command_result r = run({"--once"});
     EXPECT_EQ(r.status, 0) << r.out << r.err;
     EXPECT_TRUE(
@@ -366,7 +349,7 @@ class TarnmonRunStop : public TarnmonRun, public ::testing::WithParamInterface<i
 TEST_P(TarnmonRunStop, SignalDuringTheSleepEndsItAfterOnePassWithoutASleepAlert) {
     const int signal = GetParam();
     running_tarnmon monitor(
-        {"--interval", std::to_string(LONG_INTERVAL), "--config", example_path()});
+        {"--interval", std::to_string(LONG_INTERVAL), "--config", example::path()});
     ASSERT_TRUE(sleeping_with_drift_judged(monitor)) << monitor.err();
     auto sent = std::chrono::steady_clock::now();
     ASSERT_EQ(kill(monitor.pid, signal), 0);
@@ -398,7 +381,7 @@ INSTANTIATE_TEST_SUITE_P(Signals, TarnmonRunStop, ::testing::Values(SIGTERM, SIG
 // its first pass) ends it too: a request that the set-up cleared is made again at the first sleep.
 TEST_F(TarnmonRun, SignalWhileTheMonitorStartsEndsItWithinTwoPasses) {
     running_tarnmon monitor(
-        {"--interval", std::to_string(LONG_INTERVAL), "--config", example_path()});
+        {"--interval", std::to_string(LONG_INTERVAL), "--config", example::path()});
     ASSERT_TRUE(wait_until([&] { return monitor.out().find("runAsRoot: ") != std::string::npos; },
                            PASS_LIMIT));
     ASSERT_EQ(kill(monitor.pid, SIGTERM), 0);
@@ -418,7 +401,7 @@ TEST_F(TarnmonRun, SignalWhileTheMonitorStartsEndsItWithinTwoPasses) {
 // overrun.
 TEST_F(TarnmonRun, SleepAlertOfAnArmedJudgementReachesTheEventLog) {
     std::string file =
-        user_file(example_with("CPU_SLEEP_TIME_THRESHOLD", "CPU_SLEEP_TIME_THRESHOLD 11"));
+        user_file(example::with("CPU_SLEEP_TIME_THRESHOLD", "CPU_SLEEP_TIME_THRESHOLD 11"));
     running_tarnmon monitor({"--interval", std::to_string(LONG_INTERVAL), "--config", file});
     ASSERT_TRUE(sleeping_with_drift_judged(monitor)) << monitor.err();
     EXPECT_TRUE(wait_until(
@@ -435,7 +418,7 @@ TEST_F(TarnmonRun, SleepAlertOfAnArmedJudgementReachesTheEventLog) {
 
 TEST_F(TarnmonRun, TarnmonStopEndsTheSleepToo) {
     running_tarnmon monitor(
-        {"--interval", std::to_string(LONG_INTERVAL), "--config", example_path()});
+        {"--interval", std::to_string(LONG_INTERVAL), "--config", example::path()});
     ASSERT_TRUE(sleeping_with_drift_judged(monitor)) << monitor.err();
     command_result stop = run_command({tarnmon(), "stop"});
     EXPECT_EQ(stop.status, 0) << stop.err;
@@ -486,7 +469,7 @@ TEST_F(TarnmonRun, LibrarysSleepBindsToTarnmonAndNoneOfItsOwnNamesDoes) {
     std::string bindings = user_dir + "/ld";
     setenv("LD_DEBUG", "bindings", 1);
     setenv("LD_DEBUG_OUTPUT", bindings.c_str(), 1);
-    running_tarnmon monitor({"--once", "--config", example_path()});
+    running_tarnmon monitor({"--once", "--config", example::path()});
     int status = monitor.wait(PASS_LIMIT);
     unsetenv("LD_DEBUG");
     unsetenv("LD_DEBUG_OUTPUT");
@@ -547,7 +530,7 @@ TEST_F(TarnmonRun, MissingControlFileGivesCheckConfigsMessageAndStatusAndRunsNot
 
 TEST_F(TarnmonRun, InvalidControlFileGivesCheckConfigsVerdictAndStatusAndRunsNothing) {
     std::string file = user_file(
-        example_with("RESUME_MEMORY_PERCENT_THRESHOLD", "RESUME_MEMORY_PERCENT_THRESHOLD 950"));
+        example::with("RESUME_MEMORY_PERCENT_THRESHOLD", "RESUME_MEMORY_PERCENT_THRESHOLD 950"));
     command_result check = run_command({tarnmon(), "check-config", file});
     EXPECT_EQ(check.status, 1);
     command_result r = run({"--config", file});
@@ -560,7 +543,7 @@ TEST_F(TarnmonRun, InvalidControlFileGivesCheckConfigsVerdictAndStatusAndRunsNot
     EXPECT_FALSE(control_block_exists());
 
     // The same from the data directory, and a file that does not ask the monitor to run.
-    write_file(data_dir + "/telvzopt.trm", example_with("ACTUALLY_RUN", ""));
+    write_file(data_dir + "/telvzopt.trm", example::with("ACTUALLY_RUN", ""));
     command_result check_own = run_command({tarnmon(), "check-config"});
     command_result own = run({"--once"});
     EXPECT_EQ(own.status, 1);
@@ -573,9 +556,9 @@ TEST_F(TarnmonRun, InvalidControlFileGivesCheckConfigsVerdictAndStatusAndRunsNot
 // ---- --config and the data directory's own control file ----
 
 TEST_F(TarnmonRun, ConfigNeverReplacesTheDataDirectorysOwnControlFile) {
-    std::string own = example_with("CHECKING_INTERVAL", "CHECKING_INTERVAL 90");
+    std::string own = example::with("CHECKING_INTERVAL", "CHECKING_INTERVAL 90");
     write_file(data_dir + "/telvzopt.trm", own);
-    std::string file = user_file(read_file(example_path()));
+    std::string file = user_file(read_file(example::path()));
     command_result r = run({"--once", "--config", file});
     EXPECT_EQ(r.status, 3);
     EXPECT_EQ(r.err, "tarnmon: the data directory " + data_dir +
@@ -597,7 +580,7 @@ TEST_F(TarnmonRun, ConfigNeverReplacesTheDataDirectorysOwnControlFile) {
 TEST_F(TarnmonRun, DataDirOptionMakesTheDirectoryAndNamesItByItsRealPath) {
     std::string dir = user_dir + "/made/../data";
     std::filesystem::create_directories(user_dir + "/made");
-    command_result r = run({"--once", "--data-dir", dir, "--config", example_path()});
+    command_result r = run({"--once", "--data-dir", dir, "--config", example::path()});
     EXPECT_EQ(r.status, 0) << r.out << r.err;
     EXPECT_NE(r.out.find("data directory: " + user_dir + "/data\n"), std::string::npos) << r.out;
     EXPECT_TRUE(std::filesystem::is_regular_file(user_dir + "/data/telvzmnd.trm"));
@@ -609,7 +592,7 @@ TEST_F(TarnmonRun, DataDirOptionMakesTheDirectoryAndNamesItByItsRealPath) {
 TEST_F(TarnmonRun, RunAsRootOnThePathIsKept) {
     fakes.add("runAsRoot", "#!/bin/sh\n[ \"$1\" = lsmon.sh ] && printf '/proc/77777/fd:\\ntotal "
                            "0\\n\\n'\nexit 0\n");
-    command_result r = run({"--once", "--config", example_path()});
+    command_result r = run({"--once", "--config", example::path()});
     EXPECT_EQ(r.status, 0) << r.out << r.err;
     EXPECT_NE(r.out.find("runAsRoot: " + fakes.path_of("runAsRoot") + " (from PATH)\n"),
               std::string::npos)
@@ -628,7 +611,7 @@ TEST_F(TarnmonRun, MonitorHoldingTheBlockIsLeftAlone) {
     ASSERT_NE(address, reinterpret_cast<void *>(-1));
     block = static_cast<tarn_control_block *>(address);
     block->numLoopsBeforeCPUChecking = 7;
-    command_result r = run({"--once", "--config", example_path()});
+    command_result r = run({"--once", "--config", example::path()});
     EXPECT_EQ(r.status, 3);
     EXPECT_EQ(r.err, "tarnmon: the control block (key 0x96728017) is attached by 1 process: a "
                      "monitor runs on this host (see tarnmon status); a second one would take its "
@@ -641,7 +624,7 @@ TEST_F(TarnmonRun, MonitorHoldingTheBlockIsLeftAlone) {
 TEST_F(TarnmonRun, SegmentOfAnotherProgramIsLeftAlone) {
     int id = shmget(static_cast<key_t>(TARN_CB_KEY), 100, IPC_CREAT | 0666);
     ASSERT_NE(id, -1);
-    command_result r = run({"--once", "--config", example_path()});
+    command_result r = run({"--once", "--config", example::path()});
     EXPECT_EQ(r.status, 3);
     EXPECT_EQ(r.err, "tarnmon: the segment of key 0x96728017 is not a control block: it has 100 "
                      "bytes, not 2940036; a monitor would remove it\n");
@@ -658,7 +641,7 @@ TEST_F(TarnmonRun, EveryRunInTheSameNamespaceRuns) {
         GTEST_SKIP() << "this namespace has made a segment before";
     }
     for (int run_number = 1; run_number <= 2; ++run_number) {
-        command_result r = run({"--once", "--config", example_path()});
+        command_result r = run({"--once", "--config", example::path()});
         EXPECT_EQ(r.status, 0) << r.out << r.err;
         EXPECT_EQ(count_of(snapshot_list(), " plain "), run_number);
         int id = shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0);
