@@ -15,6 +15,7 @@
 #include "command_runner.h"
 #include "fake_commands.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 
 namespace {
 

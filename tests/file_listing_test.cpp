@@ -11,6 +11,7 @@
 #include "fake_commands.h"
 #include "filesvc.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "storage/file_listing.h"
 #include "text_lines.h"
 

@@ -15,6 +15,7 @@
 #include "fake_commands.h"
 #include "filesvc.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "storage/file_listing.h"
 #include "storage/file_system.h"
 #include "text_lines.h"

@@ -19,6 +19,7 @@
 #include "data_blocks.h"
 #include "fake_commands.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "storage/open_files.h"
 #include "text_lines.h"
 

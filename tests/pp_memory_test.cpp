@@ -30,6 +30,7 @@
 #include "memory/pp_memory.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "text_lines.h"
 
 extern char **environ;

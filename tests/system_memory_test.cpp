@@ -17,6 +17,7 @@
 #include "memory/system_memory.h"
 #include "private_ipc.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "text_lines.h"
 
 namespace {

@@ -12,6 +12,7 @@
 #include "fake_commands.h"
 #include "filesvc.h"
 #include "recording_platform.h"
+#include "starved_child.h"
 #include "text_lines.h"
 
 namespace {
