@@ -37,6 +37,7 @@
 #include "fake_proc.h"
 #include "logsvc.h"
 #include "private_ipc.h"
+#include "quiet_control_file.h"
 #include "recording_platform.h"
 #include "snapshot_stamp.h"
 #include "storage/file_system.h"
@@ -65,52 +66,6 @@ const std::string PLAIN_OPENING(PLAIN_SNAPSHOT_OPENING);
 const std::string PLAIN_CLOSING(PLAIN_SNAPSHOT_CLOSING);
 const std::string PROBLEM_OPENING(PROBLEM_SNAPSHOT_OPENING);
 const std::string PROBLEM_CLOSING(PROBLEM_SNAPSHOT_CLOSING);
-
-// Every setting the validation needs, at values a quiet host passes.
-const std::map<std::string, std::string> QUIET_SETTINGS = {
-    {"MINIMUM_JAVA_FREE_SPACE", "100"},
-    {"RESUME_JAVA_LOG_ON_PERCENT", "150"},
-    {"TOTAL_MEMORY_IN_USE_THRESHOLD", "16000000"},
-    {"TOTAL_MEMORY_PERCENT_THRESHOLD", "900"},
-    {"RESUME_MEMORY_PERCENT_THRESHOLD", "800"},
-    {"VSZ_MEMORY_THRESHOLD", "3000000"},
-    {"RSS_MEMORY_THRESHOLD", "1000000"},
-    {"DSIZ_MEMORY_THRESHOLD", "2000000"},
-    {"RSS_ABORT_MEMORY_THRESHOLD", "2500000"},
-    {"CPU_PERCENT_THRESHOLD", "900"},
-    {"CPU_TIME_THRESHOLD", "10"},
-    {"CPU_PERCENT_THRESHOLD_QV", "950"},
-    {"CPU_SLEEP_TIME_THRESHOLD", "1100"},
-    {"DASD_PERCENT_THRESHOLD", "900"},
-    {"NUM_THREADS_THRESHOLD", "2000"},
-    {"FILE_DESCRIPTORS_PERCENT_THRESHOLD", "800"},
-    {"PP_FILE_DESCRIPTORS_THRESHOLD", "1000"},
-    {"LOW_FREE_SIZE", "1"},
-    {"MAX_SNAPSHOT_FILE_SIZE", "50000"},
-};
-
-const char *const PARTITIONS[] = {"SLASH",        "VAR",     "TMP",        "CONSOLE", "FFDC",
-                                  "CONSOLE_FFDC", "DEV_SHM", "DUMP",       "EXTRA",   "KZRDUMP",
-                                  "MNT_UPGRADE",  "DATA",    "VAR_WQN_LOG"};
-
-std::string control_text(const std::map<std::string, std::string> &changes,
-                         const std::string &extra_lines = "") {
-    std::map<std::string, std::string> settings = QUIET_SETTINGS;
-    for (const char *partition : PARTITIONS) {
-        settings["DASD_PERCENT_" + std::string(partition) + "_THRESHOLD"] = "900";
-        settings["DASD_PERCENT_" + std::string(partition) + "_INODE_THRESHOLD"] = "900";
-    }
-    for (const auto &[keyword, value] : changes) {
-        settings[keyword] = value;
-    }
-    std::string text = "ACTUALLY_RUN\n";
-    for (const auto &[keyword, value] : settings) {
-        if (!value.empty()) {
-            text += keyword + " " + value + "\n";
-        }
-    }
-    return text + extra_lines;
-}
 
 // What the quiet host's commands print.
 const std::string PS_QUIET = "    1     1  1000  20000  3000 init            00:00:01\n";
@@ -334,7 +289,7 @@ INSTANTIATE_TEST_SUITE_P(Arguments, MonitorLoopInterval,
                                            interval_case{"-7", 60}, interval_case{nullptr, 60}));
 
 TEST_F(MonitorLoop, IntervalFromTheHostMakesTheControlFilesLineChangeNothing) {
-    write_control(control_text({{"CHECKING_INTERVAL", "30"}}));
+    write_control(quiet_control::text({{"CHECKING_INTERVAL", "30"}}));
     run_passes(2, "7");
     EXPECT_EQ(checking_interval, 7);
     EXPECT_EQ(trace_indexes("TARNMNDF: about to sleep for 7 seconds").size(), 1u);
@@ -343,7 +298,7 @@ TEST_F(MonitorLoop, IntervalFromTheHostMakesTheControlFilesLineChangeNothing) {
 }
 
 TEST_F(MonitorLoop, ControlFileSetsTheIntervalWithoutAnArgument) {
-    write_control(control_text({{"CHECKING_INTERVAL", "6"}}));
+    write_control(quiet_control::text({{"CHECKING_INTERVAL", "6"}}));
     on_sleep = [](int count) {
         if (count == 1) {
             TARN_CB_PTR->terminateRequest = 1;
@@ -355,7 +310,7 @@ TEST_F(MonitorLoop, ControlFileSetsTheIntervalWithoutAnArgument) {
 }
 
 TEST_F(MonitorLoop, ThreeArgumentsRunOnePassAndEndWithoutSleeping) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     EXPECT_EQ(run_once(), 0u);
     EXPECT_EQ(trace_indexes("TARNMNDF: inside while loop").size(), 1u);
     EXPECT_NE(rec::find_trace("TARNMNDF:    runOnce = TRUE"), -1);
@@ -379,7 +334,7 @@ TEST_F(MonitorLoop, ControlFileOfOneByteIsAReadFailure) {
 }
 
 TEST_F(MonitorLoop, FailedReadIsReportedWithItsCrc) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     rec::fail(rec::Call::random_read, 2, 0x55);
     run_once();
     ASSERT_EQ(rec::events().size(), 1u);
@@ -388,7 +343,7 @@ TEST_F(MonitorLoop, FailedReadIsReportedWithItsCrc) {
 }
 
 TEST_F(MonitorLoop, FailedCloseIsReportedAndReturned) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     rec::fail(rec::Call::close_file, 2, 0x66);
     EXPECT_EQ(run_once(), REPORT_RESULT);
     ASSERT_FALSE(events_of(RC_CONTROL_FILE_CLOSE).empty());
@@ -398,7 +353,7 @@ TEST_F(MonitorLoop, FailedCloseIsReportedAndReturned) {
 }
 
 TEST_F(MonitorLoop, FileWithoutActuallyRunEndsSilently) {
-    std::string text = control_text({});
+    std::string text = quiet_control::text({});
     text.erase(0, std::string("ACTUALLY_RUN\n").size());
     write_control(text);
     EXPECT_EQ(run_once(), 0u);
@@ -417,7 +372,7 @@ class MonitorLoopValidation : public MonitorLoop,
 
 TEST_P(MonitorLoopValidation, RuleDecidesSilentlyWhetherTheMonitorStarts) {
     const validation_case &c = GetParam();
-    write_control(control_text({{c.keyword, c.value}}));
+    write_control(quiet_control::text({{c.keyword, c.value}}));
     EXPECT_EQ(run_once(), 0u);
     EXPECT_EQ(rec::find_trace("TARNMNDF: Everything ok to run") != -1, c.runs);
     EXPECT_EQ(control_block_exists(), c.runs);
@@ -447,7 +402,7 @@ INSTANTIATE_TEST_SUITE_P(
 // ---- Passes ----
 
 TEST_F(MonitorLoop, QuietPassFindsNothingAndWritesItsPlainSnapshot) {
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "1"}}));
+    write_control(quiet_control::text({{"SNAPSHOT_INTERVAL", "1"}}));
     EXPECT_EQ(run_once(), 0u);
     EXPECT_TRUE(rec::events().empty());
     for (const rec::Event &event : rec::events()) {
@@ -476,7 +431,7 @@ TEST_F(MonitorLoop, QuietPassFindsNothingAndWritesItsPlainSnapshot) {
 }
 
 TEST_F(MonitorLoop, FindingWritesTheProblemSnapshotRaisesItsEventAndHoldsBackTheNext) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     set_df(df_space(95)); // "/" by space: 950 over 900
     run_passes(2);
 
@@ -512,7 +467,7 @@ TEST_F(MonitorLoop, FindingWritesTheProblemSnapshotRaisesItsEventAndHoldsBackThe
 }
 
 TEST_F(MonitorLoop, CleanPassAfterAFindingReArmsReporting) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     set_df(df_space(95));
     on_sleep = [this](int count) {
         if (count == 5) {
@@ -588,7 +543,7 @@ class signal_recorder {
 };
 
 TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAndKill) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     signal_recorder victim;
     set_ps(PS_QUIET + ps_line(victim.pid(), 2600000));
     kills_sent.clear();
@@ -612,7 +567,7 @@ TEST_F(MonitorLoop, ProcessOverItsAbortLimitIsKilledWithAbortSegmentationFaultAn
 }
 
 TEST_F(MonitorLoop, AbortFindingWithoutAPidKillsNothing) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     set_ps(PS_QUIET + ps_line(0, 2600000));
     kills_sent.clear();
     run_once();
@@ -624,7 +579,7 @@ TEST_F(MonitorLoop, AbortFindingWithoutAPidKillsNothing) {
 }
 
 TEST_F(MonitorLoop, FullExtraIsInformationOnceAndNeverHoldsBackLaterReports) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     set_df(df_space(10, 95));
     run_passes(2);
     const auto extra = events_of(RC_EXTRA_PARTITION_SPACE);
@@ -639,7 +594,7 @@ TEST_F(MonitorLoop, FullExtraIsInformationOnceAndNeverHoldsBackLaterReports) {
 }
 
 TEST_F(MonitorLoop, FullExtraIsReportedAgainAfterItWasBelowItsThreshold) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     set_df(df_space(10, 95));
     // Full, full (silent), below, full again; then a full "/" in the same pass as a full /extra
     // is reported at once, since the information never set tookLog.
@@ -664,7 +619,8 @@ TEST_F(MonitorLoop, FullExtraIsReportedAgainAfterItWasBelowItsThreshold) {
 }
 
 TEST_F(MonitorLoop, PlainSnapshotsComeAtTheirIntervalWithTrendAnalysisBeforeThem) {
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "3"}, {"TREND_ANALYSIS_POINTS", "2"}}));
+    write_control(
+        quiet_control::text({{"SNAPSHOT_INTERVAL", "3"}, {"TREND_ANALYSIS_POINTS", "2"}}));
     run_passes(9);
     EXPECT_EQ(count_of(snapshots(), PLAIN_OPENING), 3);
     const std::vector<int> passes = trace_indexes("TARNMNDF: inside while loop");
@@ -685,7 +641,8 @@ TEST_F(MonitorLoop, PlainSnapshotsComeAtTheirIntervalWithTrendAnalysisBeforeThem
 }
 
 TEST_F(MonitorLoop, SnapshotIntervalOfZeroWritesNoPlainSnapshotAndNoTrend) {
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "0"}, {"TREND_ANALYSIS_POINTS", "2"}}));
+    write_control(
+        quiet_control::text({{"SNAPSHOT_INTERVAL", "0"}, {"TREND_ANALYSIS_POINTS", "2"}}));
     run_passes(3);
     EXPECT_EQ(count_of(snapshots(), PLAIN_OPENING), 0);
     EXPECT_TRUE(trace_indexes("TARNMNDF: Perform trend analysis").empty());
@@ -706,7 +663,7 @@ class MonitorLoopFinding : public MonitorLoop,
 
 TEST_P(MonitorLoopFinding, FindingIsReportedWithItsCodeValueAndErrorText) {
     const finding_case &c = GetParam();
-    write_control(control_text(c.settings));
+    write_control(quiet_control::text(c.settings));
     c.host(fakes);
     run_once();
     ASSERT_EQ(rec::events().size(), 1u) << std::hex << rec::events()[0].record.reason_code;
@@ -812,9 +769,9 @@ TEST_F(MonitorLoop, ExternalRoutinesHaveTheirTextFramedAndOneReturningNothingAdd
                            reinterpret_cast<void *>(&tarn_external_check2));
     rec::register_function("testmod", "returns_nothing",
                            reinterpret_cast<void *>(&returns_nothing));
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "1"}},
-                               "EXTERNAL_CHECKING_ROUTINE testmod returns_nothing\n"
-                               "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check2\n"));
+    write_control(quiet_control::text({{"SNAPSHOT_INTERVAL", "1"}},
+                                      "EXTERNAL_CHECKING_ROUTINE testmod returns_nothing\n"
+                                      "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check2\n"));
     run_once();
     const std::string file = snapshots();
     const std::string message = "Message 2 returned data \n\r Second line of Message 2\n\r";
@@ -833,9 +790,9 @@ TEST_F(MonitorLoop, TextLongerThanTheRoomLeftGivesTheOverflowLineOnceAndLaterRou
                            reinterpret_cast<void *>(&returns_too_much));
     rec::register_function("telvzmnd", "tarn_external_check3",
                            reinterpret_cast<void *>(&tarn_external_check3));
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "1"}},
-                               "EXTERNAL_CHECKING_ROUTINE testmod returns_too_much\n"
-                               "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check3\n"));
+    write_control(quiet_control::text({{"SNAPSHOT_INTERVAL", "1"}},
+                                      "EXTERNAL_CHECKING_ROUTINE testmod returns_too_much\n"
+                                      "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check3\n"));
     run_once();
     overflowing_text = nullptr;
     const std::string file = snapshots();
@@ -853,7 +810,7 @@ TEST_F(MonitorLoop, TextLongerThanTheRoomLeftGivesTheOverflowLineOnceAndLaterRou
 // ---- The sleep and its drift ----
 
 TEST_F(MonitorLoop, SleepThatOverrunsIsCutShortAndReportedByTheNextPass) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     step = 1;
     on_sleep = [](int count) {
         if (count == 1) {
@@ -881,7 +838,7 @@ TEST_F(MonitorLoop, SleepThatOverrunsIsCutShortAndReportedByTheNextPass) {
 }
 
 TEST_F(MonitorLoop, NoDriftIsFlaggedWhileTheCountdownRuns) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     step = 2;
     on_sleep = [](int count) {
         if (count == 60) {
@@ -903,7 +860,7 @@ namespace {
 // ---- Stopping, and a long run ----
 
 TEST_F(MonitorLoop, TarnmonStopFromAnotherProcessEndsTheLoopAfterTheNextPass) {
-    write_control(control_text({}));
+    write_control(quiet_control::text({}));
     char data_dir[] = "/tmp/tarn-stop-XXXXXX";
     ASSERT_NE(mkdtemp(data_dir), nullptr);
     const std::string command = "TELV_DATA_DIR=" + std::string(data_dir) + " '" +
@@ -932,8 +889,8 @@ int open_descriptors() {
 }
 
 TEST_F(MonitorLoop, ThousandPassesLeaveNoAllocationDescriptorOrChildBehind) {
-    write_control(control_text({{"SNAPSHOT_INTERVAL", "10"}, {"TREND_ANALYSIS_POINTS", "4"}},
-                               "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check1\n"));
+    write_control(quiet_control::text({{"SNAPSHOT_INTERVAL", "10"}, {"TREND_ANALYSIS_POINTS", "4"}},
+                                      "EXTERNAL_CHECKING_ROUTINE telvzmnd tarn_external_check1\n"));
     rec::register_function("telvzmnd", "tarn_external_check1",
                            reinterpret_cast<void *>(&tarn_external_check1));
     const int descriptors = open_descriptors();
