@@ -567,21 +567,6 @@ void monitor_resident(benchmark::State &state) {
     state.counters["hwm_end_kb"] = static_cast<double>(at_end.hwm_kb);
 }
 
-// The resident memory benchmark only when asked for by name.
-std::vector<char *> with_default_filter(int argc, char **argv) {
-    static std::string excluded = std::string("--benchmark_filter=-") + RESIDENT_NAME;
-    std::vector<char *> arguments(argv, argv + argc);
-    bool filtered = false;
-    for (int i = 1; i < argc; ++i) {
-        filtered = filtered || std::strncmp(argv[i], "--benchmark_filter", 18) == 0;
-    }
-    if (!filtered) {
-        arguments.push_back(excluded.data());
-    }
-    arguments.push_back(nullptr);
-    return arguments;
-}
-
 } // namespace
 
 int main(int argc, char **argv) {
@@ -617,7 +602,7 @@ int main(int argc, char **argv) {
         ->Iterations(1)
         ->UseRealTime()
         ->Unit(benchmark::kSecond);
-    std::vector<char *> arguments = with_default_filter(argc, argv);
+    std::vector<char *> arguments = unless_named(argc, argv, RESIDENT_NAME);
     int count = static_cast<int>(arguments.size()) - 1;
     benchmark::Initialize(&count, arguments.data());
     benchmark::RunSpecifiedBenchmarks();

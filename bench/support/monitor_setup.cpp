@@ -58,3 +58,18 @@ bool set_up_monitor() {
 void start_pass() {
     start_pass_data();
 }
+
+std::vector<char *> unless_named(int argc, char **argv, const char *name) {
+    static std::string excluded;
+    excluded = std::string("--benchmark_filter=-") + name;
+    std::vector<char *> arguments(argv, argv + argc);
+    bool filtered = false;
+    for (int i = 1; i < argc; ++i) {
+        filtered = filtered || std::strncmp(argv[i], "--benchmark_filter", 18) == 0;
+    }
+    if (!filtered) {
+        arguments.push_back(excluded.data());
+    }
+    arguments.push_back(nullptr);
+    return arguments;
+}
