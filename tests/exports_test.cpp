@@ -111,6 +111,21 @@ TEST(Exports, OnlyTheMarkedEntryPointsLeaveTheLibrary) {
     }
 }
 
+TEST(Exports, TheSwitchesOfOtherPartiesLeaveTheLibrary) {
+    std::set<std::string> defined = dynamic_symbols("--defined-only");
+    for (const char *entry :
+         {"tarn_enable_cpu_alerts", "tarn_disable_cpu_alerts", "tarn_trigger_cpu_alert04",
+          "tarn_set_logging_type", "java_set_logging_type"}) {
+        EXPECT_TRUE(defined.contains(entry)) << entry;
+    }
+    // The library calls the Java bridge; the platform defines it.
+    std::set<std::string> undefined = dynamic_symbols("--undefined-only");
+    for (const char *bridge : {"jcbGetBooleanArgument", "jcbGetLastErrorMessage",
+                               "jcbSetNativeFunctionError", "jcbSetVoidResult"}) {
+        EXPECT_TRUE(undefined.contains(bridge)) << bridge;
+    }
+}
+
 TEST(Exports, PlatformServicesStayUndefined) {
     std::set<std::string> services = platform_services();
     ASSERT_GE(services.size(), 20u);

@@ -23,6 +23,7 @@
 #include "platform_test_support.h"
 #include "private_ipc.h"
 #include "quiet_control_file.h"
+#include "quiet_host.h"
 #include "tracesvc.h"
 
 // ---- The module service, seen from in front ----
@@ -92,18 +93,8 @@ std::string control_text() {
                                std::string("TARNCHECKTEST_STATUS green\n") + ROUTINES);
 }
 
-// What the quiet host's commands print.
+// What the quiet host's ps prints.
 const std::string PS = "    1     1  1000  20000  3000 init            00:00:01\n";
-const std::string FREE =
-    "               total        used        free      shared  buff/cache   available\n"
-    "Mem:         1000000      200000      600000        1000      200000      700000\n"
-    "Swap:              0           0           0\n";
-const std::string MEMINFO = "MemTotal:        1000000 kB\nMemFree:          600000 kB\n";
-const std::string FILE_NR = "1000\t0\t100000\n";
-const std::string DF_SPACE = "Filesystem     Type      Size  Used Avail Use% Mounted on\n"
-                             "/dev/vda1      ext4       20G    2G   18G  10% /\n";
-const std::string DF_INODES = "Filesystem      Inodes  IUsed   IFree IUse% Mounted on\n"
-                              "/dev/vda1      1310720 131072 1179648   10% /\n";
 const std::string LSMON = "/proc/1/fd:\ntotal 0\nlrwx------ 1 root root 64 Mar  5 07:00 0 -> "
                           "/dev/null\n\n";
 
@@ -196,13 +187,7 @@ class MonitorLoopOnThePlatform : public platform_test::PlatformTest {
         private_ipc::use_up_id_zero();
         platform_test::set_variable("TELV_MODULE_PATH",
                                     std::string(TARN_CHECK_MODULE_DIR) + ":" + TARN_LIBRARY_DIR);
-        fakes.add_printing("ps", PS);
-        fakes.add_printing("free", FREE);
-        fakes.add("cat", "#!/bin/sh\ncase \"$1\" in\n/proc/meminfo) printf '%s' '" + MEMINFO +
-                             "' ;;\n/proc/sys/fs/file-nr) printf '%s' '" + FILE_NR +
-                             "' ;;\n*) exec /bin/cat \"$@\" ;;\nesac\n");
-        fakes.add("df", "#!/bin/sh\nif [ \"$1\" = -h ]; then printf '%s' '" + DF_SPACE +
-                            "'; else printf '%s' '" + DF_INODES + "'; fi\n");
+        quiet_host::add_commands(fakes, PS);
         fakes.add("runAsRoot",
                   "#!/bin/sh\ncase \"$1\" in\nlsmon.sh) printf '%s' '" + LSMON + "' ;;\nesac\n");
         resolutions.clear();

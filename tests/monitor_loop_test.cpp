@@ -35,6 +35,7 @@
 #include "data_blocks.h"
 #include "fake_commands.h"
 #include "fake_proc.h"
+#include "fresh_monitor.h"
 #include "logsvc.h"
 #include "private_ipc.h"
 #include "quiet_control_file.h"
@@ -113,16 +114,7 @@ class MonitorLoop : public ::testing::Test {
     void SetUp() override {
         REQUIRE_PRIVATE_KEY();
         key_is_ours = true;
-        private_ipc::use_up_id_zero();
-        rec::reset();
-        reset_settings();
-        reset_process_listing_state();
-        extraFileSystemSRCOn = 0;
-        clear_ps_data_block();
-        setenv("TZ", "UTC", 1);
-        tzset();
-        snapshot_clock = fixed_clock;
-        std::memset(file_buffer, 0, FILE_BUFFER_SIZE);
+        fresh_monitor::reset();
         tree.emplace(1000, 100);
         tree->set_cpus(1);
         tree->set_process(1, "init", 1, 1);

@@ -431,6 +431,100 @@ TEST_F(TarnmonRun, TarnmonStopEndsTheSleepToo) {
     EXPECT_EQ(raised.find("\"reason\":\"0xE153\""), std::string::npos) << raised;
 }
 
+// ---- The switches, from another process ----
+
+class TarnmonRunSwitches : public TarnmonRun {
+  protected:
+    // Waits until the monitor sleeps between passes: the loop marks the start of every sleep with
+    // a measure of -1, which the trigger sets to 0.
+    bool sleeping(running_tarnmon &monitor) {
+        return monitor.pid != -1 && (block != nullptr || monitor_block() != nullptr) &&
+               wait_until([&] { return read_field(block->sleep_time_percent) == -1; }, PASS_LIMIT);
+    }
+
+    // tarnmon `command` `word`, which says `message` and succeeds.
+    static void turn(const std::string &command, const std::string &word,
+                     const std::string &message) {
+        command_result r = run_command({tarnmon(), command, word});
+        EXPECT_EQ(r.status, 0) << r.err;
+        EXPECT_EQ(r.out, message);
+        EXPECT_EQ(r.err, "");
+    }
+
+    // The lines of the event log that raise `reason` ("0xE153").
+    std::vector<std::string> events_of(const std::string &reason) const {
+        std::vector<std::string> found;
+        std::istringstream lines(events());
+        for (std::string line; std::getline(lines, line);) {
+            if (line.find("\"reason\":\"" + reason + "\"") != std::string::npos) {
+                found.push_back(line);
+            }
+        }
+        return found;
+    }
+    // tarnmon alerts trigger, and the wait for the sleep alert it brings on: whether the event
+    // log came to hold `count` of them.
+    bool triggered(size_t count) const {
+        turn("alerts", "trigger",
+             "sleep alert forced: the monitor ends its sleep within a second, and its next pass "
+             "reports the alert\n");
+        return wait_until([&] { return events_of("0xE153").size() >= count; }, PASS_LIMIT);
+    }
+};
+
+// The trigger comes while the monitor sleeps the first of its 600-second sleeps: at most the one
+// second under way is slept after it, and the pass that follows reports the sleep alert with the
+// measure the trigger left, 0 (the loop allows 660 seconds, so no second measured meanwhile is an
+// overrun).
+TEST_F(TarnmonRunSwitches, AlertsTriggerEndsTheSleepAndTheNextPassReportsTheSleepAlert) {
+    running_tarnmon monitor(
+        {"--interval", std::to_string(LONG_INTERVAL), "--config", example::path()});
+    ASSERT_TRUE(sleeping(monitor)) << monitor.err();
+    ASSERT_TRUE(triggered(1)) << events();
+    kill(monitor.pid, SIGTERM);
+    EXPECT_EQ(monitor.wait(PASS_LIMIT), 0) << monitor.err();
+
+    std::vector<std::string> alerts = events_of("0xE153");
+    ASSERT_EQ(alerts.size(), 1u);
+    EXPECT_NE(alerts[0].find("\"severity\":\"error\""), std::string::npos) << alerts[0];
+    EXPECT_NE(alerts[0].find("\"compRc\":\"0x0\""), std::string::npos) << alerts[0];
+    EXPECT_TRUE(events_of("0xE152").empty()) << events();
+    std::string log = trace();
+    size_t triggered = log.find("TARNOTHF: <-- tarn_trigger_cpu_alert04, src = 0, crc = 0 (hex)");
+    ASSERT_NE(triggered, std::string::npos);
+    size_t next_pass = log.find("TARNMNDF: inside while loop", triggered);
+    ASSERT_NE(next_pass, std::string::npos);
+    EXPECT_LE(
+        count_of(log.substr(triggered, next_pass - triggered), "TARNMNDF: slept for 1 second;"), 1);
+    EXPECT_NE(log.find("TARNMNDF:     TARN_CB_PTR->sleep_time_percent = 0 percent", next_pass),
+              std::string::npos);
+    // The pass before the trigger, the one it brought on, and the one after SIGTERM.
+    EXPECT_EQ(count_of(log, "TARNMNDF: inside while loop"), 3);
+}
+
+// Each switch of the logging type is seen by the next event: the trigger brings one on.
+TEST_F(TarnmonRunSwitches, EventsInfoMakesTheNextEventInformationalAndEventsErrorSwitchesBack) {
+    running_tarnmon monitor(
+        {"--interval", std::to_string(LONG_INTERVAL), "--config", example::path()});
+    ASSERT_TRUE(sleeping(monitor)) << monitor.err();
+    turn("events", "info",
+         "events of the monitor are informational from now on (until an event of a full /extra, "
+         "which sets them back to errors)\n");
+    EXPECT_EQ(read_field(block->logAsInfo), 1u);
+    ASSERT_TRUE(triggered(1)) << events();
+    ASSERT_TRUE(sleeping(monitor)) << monitor.err();
+    turn("events", "error", "events of the monitor are errors from now on\n");
+    EXPECT_EQ(read_field(block->logAsInfo), 0u);
+    ASSERT_TRUE(triggered(2)) << events();
+    kill(monitor.pid, SIGTERM);
+    EXPECT_EQ(monitor.wait(PASS_LIMIT), 0) << monitor.err();
+
+    std::vector<std::string> alerts = events_of("0xE153");
+    ASSERT_EQ(alerts.size(), 2u);
+    EXPECT_NE(alerts[0].find("\"severity\":\"informational\""), std::string::npos) << alerts[0];
+    EXPECT_NE(alerts[1].find("\"severity\":\"error\""), std::string::npos) << alerts[1];
+}
+
 // ---- The library and its sleep ----
 
 // The names that the shared library defines for the loader, as nm lists them.

@@ -1,9 +1,10 @@
-// tarnmon status, stop, limits and overrides, run as separate processes against a real control
-// block in a private IPC namespace; the command line every command shares; tarnmon snapshots over
-// files that no monitor wrote.
+// tarnmon status, stop, alerts, events, limits and overrides, run as separate processes against a
+// real control block in a private IPC namespace; the command line every command shares; tarnmon
+// snapshots over files that no monitor wrote.
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstdint>
 #include <cstdlib>
@@ -611,6 +612,161 @@ TEST_F(Tarnmon, OverridesWithoutAMonitorSaysSo) {
     EXPECT_EQ(r.err,
               "tarnmon: no monitor has created its control block (key 0x96728017) on this host\n");
     EXPECT_EQ(run_command({tarnmon(), "overrides", "extra"}).status, 2);
+}
+
+// tarnmon alerts and events.
+
+const std::string ALERTS_USAGE = "usage: tarnmon alerts on|off|trigger\n";
+const std::string EVENTS_USAGE = "usage: tarnmon events info|error\n";
+const std::string ALERTS_ON = "CPU alerts on: CPU use and the monitor's sleep are judged again "
+                              "from the 11th pass from now, and the next finding is reported\n";
+const std::string ALERTS_OFF = "CPU alerts off for the next 59 passes: CPU use and the monitor's "
+                               "sleep are judged again from the 60th pass from now\n";
+const std::string ALERTS_TRIGGER = "sleep alert forced: the monitor ends its sleep within a "
+                                   "second, and its next pass reports the alert\n";
+const std::string EVENTS_INFO = "events of the monitor are informational from now on (until an "
+                                "event of a full /extra, which sets them back to errors)\n";
+const std::string EVENTS_ERROR = "events of the monitor are errors from now on\n";
+
+// The nine fields at the end of the block, analysisIndex first.
+std::array<uint32_t, 9> last_fields(const tarn_control_block *block) {
+    std::array<uint32_t, 9> words;
+    std::memcpy(words.data(), &block->analysisIndex, sizeof words);
+    return words;
+}
+
+TEST_F(Tarnmon, AlertsTurnTheCpuAlertSwitchesOfTheBlockThroughTheLibrary) {
+    create_block();
+    block->numLoopsBeforeCPUChecking = 5;
+    block->tookLog = 1;
+    block->maxSleepTime = 66;
+    block->sleep_time_percent = -1;
+    auto said = [](const std::vector<std::string> &words, const std::string &message) {
+        command_result r = run_command(words);
+        EXPECT_EQ(r.status, 0) << r.err;
+        EXPECT_EQ(r.out, message);
+        EXPECT_EQ(r.err, "");
+    };
+    said({tarnmon(), "alerts", "off"}, ALERTS_OFF);
+    EXPECT_EQ(block->numLoopsBeforeCPUChecking, 60);
+    EXPECT_EQ(block->tookLog, 1u);
+    said({tarnmon(), "alerts", "on"}, ALERTS_ON);
+    EXPECT_EQ(block->numLoopsBeforeCPUChecking, 11);
+    EXPECT_EQ(block->tookLog, 0u);
+    block->tookLog = 1;
+    said({tarnmon(), "alerts", "trigger"}, ALERTS_TRIGGER);
+    EXPECT_EQ(block->sleep_time_percent, 0);
+    EXPECT_EQ(block->maxSleepTime, 0);
+    EXPECT_EQ(block->tookLog, 0u);
+    EXPECT_EQ(block->numLoopsBeforeCPUChecking, 0);
+    EXPECT_EQ(block->sleepTimeExceeded, 1u);
+    // The library's own traces, in the monitor's trace file; no event.
+    std::ifstream in(data_dir + "/telvzmnd.trace");
+    std::ostringstream trace;
+    trace << in.rdbuf();
+    for (const char *name :
+         {"tarn_disable_cpu_alerts", "tarn_enable_cpu_alerts", "tarn_trigger_cpu_alert04"}) {
+        EXPECT_NE(
+            trace.str().find(std::string("TARNOTHF: <-- ") + name + ", src = 0, crc = 0 (hex)"),
+            std::string::npos)
+            << name;
+    }
+    EXPECT_EQ(event_log(), "");
+}
+
+TEST_F(Tarnmon, EventsSetTheLoggingTypeOfTheBlock) {
+    create_block();
+    command_result info = run_command({tarnmon(), "events", "info"});
+    EXPECT_EQ(info.status, 0) << info.err;
+    EXPECT_EQ(info.out, EVENTS_INFO);
+    EXPECT_EQ(block->logAsInfo, 1u);
+    command_result error = run_command({tarnmon(), "events", "error"});
+    EXPECT_EQ(error.status, 0) << error.err;
+    EXPECT_EQ(error.out, EVENTS_ERROR);
+    EXPECT_EQ(block->logAsInfo, 0u);
+    EXPECT_EQ(event_log(), "");
+}
+
+TEST_F(Tarnmon, AlertsAndEventsWithoutAMonitorSaySoAndChangeNothing) {
+    for (const char *word : {"on", "off", "trigger"}) {
+        command_result r = run_command({tarnmon(), "alerts", word});
+        EXPECT_EQ(r.status, 3) << word;
+        EXPECT_EQ(r.out, "") << word;
+        EXPECT_EQ(r.err, "tarnmon: no monitor has created its control block (key 0x96728017) on "
+                         "this host; nothing was changed\n");
+    }
+    for (const char *word : {"info", "error"}) {
+        command_result r = run_command({tarnmon(), "events", word});
+        EXPECT_EQ(r.status, 3) << word;
+        EXPECT_EQ(r.err, "tarnmon: no monitor has created its control block (key 0x96728017) on "
+                         "this host; nothing was changed\n");
+    }
+    EXPECT_EQ(shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0), -1);
+    // A segment of another program under the key is left as it is.
+    create_block(TARN_CB_SIZE + 4);
+    std::memset(block, 0x5A, TARN_CB_SIZE + 4);
+    command_result r = run_command({tarnmon(), "alerts", "trigger"});
+    EXPECT_EQ(r.status, 3);
+    EXPECT_EQ(r.err, "tarnmon: the segment of key 0x96728017 is not a control block: it has "
+                     "2940040 bytes, not 2940036; nothing was changed\n");
+    EXPECT_EQ(run_command({tarnmon(), "events", "info"}).status, 3);
+    const auto *bytes = reinterpret_cast<const unsigned char *>(block);
+    EXPECT_TRUE(
+        std::all_of(bytes, bytes + TARN_CB_SIZE + 4, [](unsigned char b) { return b == 0x5A; }));
+    EXPECT_EQ(event_log(), "");
+}
+
+TEST_F(Tarnmon, AlertsAndEventsRefuseAnyOtherWordWithTheirUsage) {
+    create_block();
+    const auto before = last_fields(block);
+    auto refused = [](const std::vector<std::string> &words, const std::string &err) {
+        command_result r = run_command(words);
+        EXPECT_EQ(r.status, 2) << words.back();
+        EXPECT_EQ(r.out, "") << words.back();
+        EXPECT_EQ(r.err, err) << words.back();
+    };
+    refused({tarnmon(), "alerts"},
+            "tarnmon: alerts needs one word: on, off or trigger\n" + ALERTS_USAGE);
+    refused({tarnmon(), "alerts", "ON"},
+            "tarnmon: alerts takes on, off or trigger, not 'ON'\n" + ALERTS_USAGE);
+    refused({tarnmon(), "alerts", "info"},
+            "tarnmon: alerts takes on, off or trigger, not 'info'\n" + ALERTS_USAGE);
+    refused({tarnmon(), "alerts", "o\x1bn"},
+            "tarnmon: alerts takes on, off or trigger, not 'o\\x1bn'\n" + ALERTS_USAGE);
+    refused({tarnmon(), "alerts", "on", "off"}, ALERTS_USAGE);
+    refused({tarnmon(), "alerts", "--on"}, ALERTS_USAGE);
+    refused({tarnmon(), "events"},
+            "tarnmon: events needs one word: info or error\n" + EVENTS_USAGE);
+    refused({tarnmon(), "events", "informational"},
+            "tarnmon: events takes info or error, not 'informational'\n" + EVENTS_USAGE);
+    refused({tarnmon(), "events", "on"},
+            "tarnmon: events takes info or error, not 'on'\n" + EVENTS_USAGE);
+    refused({tarnmon(), "events", "info", "error"}, EVENTS_USAGE);
+    refused({tarnmon(), "events", "-"}, EVENTS_USAGE);
+    EXPECT_EQ(last_fields(block), before);
+}
+
+TEST_F(Tarnmon, AlertsAndEventsHelpIsTheirUsageAndSummary) {
+    // Each command, its usage and summary, and its line in tarnmon's list of commands.
+    const std::string helps[][3] = {
+        {"alerts",
+         ALERTS_USAGE + "switch the running monitor's CPU alerts on or off, or force its sleep "
+                        "alert\n",
+         "\n  alerts on|off|trigger  switch the running monitor's CPU alerts on or off, or force "
+         "its sleep alert\n"},
+        {"events",
+         EVENTS_USAGE + "raise the running monitor's events as informational or as errors\n",
+         "\n  events info|error      raise the running monitor's events as informational or as "
+         "errors\n"},
+    };
+    std::string list = run_command({tarnmon(), "--help"}).out;
+    for (const auto &[name, help, listed] : helps) {
+        command_result r = run_command({tarnmon(), name, "--help"});
+        EXPECT_EQ(r.status, 0) << name;
+        EXPECT_EQ(r.out,
+                  help + "\nexit status: 0 fine, 1 finding, 2 usage error, 3 not available\n");
+        EXPECT_NE(list.find(listed), std::string::npos) << list;
+    }
 }
 
 // tarnmon snapshots over files written here; no control block is involved.

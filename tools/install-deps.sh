@@ -7,6 +7,7 @@ packages=(
   cmake ninja-build g++ clang libclang-rt-14-dev
   libgtest-dev libgmock-dev googletest libbenchmark-dev
   binutils procps util-linux coreutils git
+  openjdk-17-jdk-headless
 )
 
 missing=()

@@ -70,6 +70,8 @@ int check_control_file(const char *path, check_report report, int32_t *checking_
 
 int command_status(const command_line &line);
 int command_stop(const command_line &line);
+int command_alerts(const command_line &line);
+int command_events(const command_line &line);
 int command_check_config(const command_line &line);
 int command_snapshots(const command_line &line);
 int command_limits(const command_line &line);

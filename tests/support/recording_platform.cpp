@@ -15,6 +15,7 @@
 
 #include "data_files.h"
 #include "filesvc.h"
+#include "jcb.h"
 #include "memsvc.h"
 #include "modsvc.h"
 #include "telvmemdebug.h"
@@ -41,6 +42,9 @@ struct State {
     std::map<void *, std::string> allocations;
     std::string directory;
     std::atomic<uint32_t> pid{0}; // 0 = the process's own
+    std::vector<BridgeCall> bridge_calls;
+    int boolean_argument = 0;
+    std::string last_error_message;
 };
 
 // Never destroyed: the clean-up of the data directory at exit, and any trace of a static
@@ -74,6 +78,23 @@ bool planned_failure(Call call, uint32_t *rc, uint32_t *crc) {
         *crc = f.crc;
     }
     return true;
+}
+
+// The text of a printf-style format and its arguments.
+std::string formatted(const char *format, va_list args) {
+    va_list again;
+    va_copy(again, args);
+    int length = std::vsnprintf(nullptr, 0, format, args);
+    std::string text(length > 0 ? static_cast<size_t>(length) : 0, '\0');
+    std::vsnprintf(text.data(), text.size() + 1, format, again);
+    va_end(again);
+    return text;
+}
+
+void record_bridge_call(BridgeCall call) {
+    State &s = state();
+    std::lock_guard guard(s.lock);
+    s.bridge_calls.push_back(std::move(call));
 }
 
 void make_directory() {
@@ -189,6 +210,28 @@ std::vector<std::string> live_allocations() {
     return live;
 }
 
+jcb_context *java_context() {
+    // Only its address counts: the bridge of the tests keeps nothing in a context.
+    static char context;
+    return reinterpret_cast<jcb_context *>(&context);
+}
+
+void set_boolean_argument(int value) {
+    State &s = state();
+    std::lock_guard guard(s.lock);
+    s.boolean_argument = value;
+}
+
+void set_last_error_message(const std::string &text) {
+    State &s = state();
+    std::lock_guard guard(s.lock);
+    s.last_error_message = text;
+}
+
+const std::vector<BridgeCall> &bridge_calls() {
+    return state().bridge_calls;
+}
+
 void set_pid(uint32_t pid) {
     state().pid = pid;
 }
@@ -205,6 +248,9 @@ void reset() {
         s.counts.fill(0);
         s.functions.clear();
         s.allocations.clear();
+        s.bridge_calls.clear();
+        s.boolean_argument = 0;
+        s.last_error_message.clear();
     }
     if (!s.directory.empty()) {
         std::error_code ignored;
@@ -215,6 +261,7 @@ void reset() {
 
 } // namespace rec
 
+using rec::BridgeCall;
 using rec::Call;
 using rec::planned_failure;
 
@@ -294,13 +341,9 @@ uint32_t filesvc_close_file(filesvc_handle_t handle, uint32_t *crc) {
 int tracesvc_trace(const char *format, ...) {
     va_list args;
     va_start(args, format);
-    va_list again;
-    va_copy(again, args);
-    int length = std::vsnprintf(nullptr, 0, format, args);
+    std::string line = rec::formatted(format, args);
     va_end(args);
-    std::string line(length > 0 ? static_cast<size_t>(length) : 0, '\0');
-    std::vsnprintf(line.data(), line.size() + 1, format, again);
-    va_end(again);
+    auto length = static_cast<int>(line.size());
     if (std::getenv("REC_TRACE_ECHO") != nullptr) {
         std::fprintf(stderr, "%s\n", line.c_str());
     }
@@ -338,6 +381,37 @@ uint32_t logsvc_microcode_log(void *record, uint32_t *crc) {
     std::lock_guard guard(s.lock);
     s.events.push_back(std::move(event));
     return failing ? rc : 0;
+}
+
+int jcbGetBooleanArgument(jcb_context *, int *value) {
+    uint32_t rc;
+    if (planned_failure(Call::get_boolean_argument, &rc, nullptr)) {
+        return static_cast<int>(rc);
+    }
+    rec::State &s = rec::state();
+    std::lock_guard guard(s.lock);
+    *value = s.boolean_argument;
+    return 0;
+}
+
+const char *jcbGetLastErrorMessage(void) {
+    return rec::state().last_error_message.c_str();
+}
+
+void jcbSetNativeFunctionError(jcb_context *ctx, const char *format, ...) {
+    va_list args;
+    va_start(args, format);
+    std::string text = rec::formatted(format, args);
+    va_end(args);
+    rec::record_bridge_call({BridgeCall::Kind::native_function_error, ctx, std::move(text)});
+}
+
+void jcbSetReturnCodes(jcb_context *ctx, uint32_t src, uint32_t crc) {
+    rec::record_bridge_call({BridgeCall::Kind::return_codes, ctx, "", src, crc});
+}
+
+void jcbSetVoidResult(jcb_context *ctx) {
+    rec::record_bridge_call({BridgeCall::Kind::void_result, ctx, ""});
 }
 
 uint32_t modsvc_get_func_addr2(const char *module, const char *function, void **address,

@@ -9,6 +9,7 @@
 #include <string_view>
 #include <vector>
 
+#include "jcb.h"
 #include "logsvc.h"
 
 namespace rec {
@@ -26,6 +27,7 @@ enum class Call {
     ckptr,
     malloc, // a failed allocation returns null; rc and crc are ignored
     calloc,
+    get_boolean_argument, // the Java bridge's fetch fails with rc; crc is ignored
     count_
 };
 
@@ -69,12 +71,29 @@ void register_function(const std::string &module, const std::string &function, v
 // Blocks of the debugging allocator still live, as "file:line" each.
 std::vector<std::string> live_allocations();
 
+// The Java bridge. A call's context is java_context(); its one boolean argument is what
+// set_boolean_argument gave (0 after each reset), and jcbGetLastErrorMessage gives the text of
+// set_last_error_message (empty after each reset). What the library sets on a call is kept in
+// order.
+struct BridgeCall {
+    enum class Kind { native_function_error, return_codes, void_result };
+    Kind kind;
+    const jcb_context *context;
+    std::string text; // native_function_error: the formatted message
+    uint32_t src = 0; // return_codes
+    uint32_t crc = 0; // return_codes
+};
+jcb_context *java_context();
+void set_boolean_argument(int value);
+void set_last_error_message(const std::string &text);
+const std::vector<BridgeCall> &bridge_calls();
+
 // What tracesvc_getpid returns from now on: `pid`, or this process's own pid when 0 (as after each
 // reset).
 void set_pid(uint32_t pid);
 
-// Back to a fresh platform: no traces, events, failures, registered functions, allocations
-// remembered; a new empty data directory.
+// Back to a fresh platform: no traces, events, failures, registered functions, allocations,
+// bridge calls remembered; a new empty data directory.
 void reset();
 
 } // namespace rec

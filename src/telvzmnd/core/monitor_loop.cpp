@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include "capture/snapshot_file.h"
+#include "core/alert_switches.h"
 #include "core/control_block.h"
 #include "core/control_file.h"
 #include "core/problem_reporting.h"
@@ -39,8 +40,7 @@ void sleep_one_second() {
     sleep(1);
 }
 
-constexpr int32_t CPU_CHECKING_COUNTDOWN = 11; // passes before CPU checking is armed at start
-constexpr uint32_t REPORT_SRC = 2;             // the system return code of the loop's events
+constexpr uint32_t REPORT_SRC = 2; // the system return code of the loop's events
 constexpr int KILL_SIGNALS[] = {SIGABRT, SIGSEGV, SIGKILL};
 constexpr char FRAME_LINE[] = "  \n\r";
 
@@ -325,7 +325,7 @@ TARN_EXPORT uint32_t tarn_mon_main(int32_t argc, char **argv) {
         run.src = tarn_init(&run.crc);
         run.block = TARN_CB_PTR.get();
         if (run.src == 0 && run.block != nullptr) {
-            write_field(run.block->numLoopsBeforeCPUChecking, CPU_CHECKING_COUNTDOWN);
+            write_field(run.block->numLoopsBeforeCPUChecking, CPU_ALERTS_ON_COUNTDOWN);
             write_field(run.block->sleepTimeExceeded, 0);
             write_field(run.block->terminateRequest, 0);
             while (run.src == 0 && run.keepRunning == 1) {
