@@ -96,11 +96,7 @@ constexpr int EXTRA_PROCESSES = 5000;
 constexpr size_t LARGE_BYTES = size_t{4} << 30;
 // Passes of each size between two touches of the 4 GiB, which cost far more than a pass.
 constexpr int PASSES_PER_SIZE = 4;
-// Above the benchmark's own 4 GiB and anything else on this machine, below the size guard.
-constexpr int32_t RSS_OUT_OF_REACH = 8000000;
 constexpr int32_t LISTED_OUT_OF_REACH = 100000;
-// Tenths of a percent of the machine: no sum of shares comes near it.
-constexpr int32_t APPLIANCE_CPU_OUT_OF_REACH = 100000;
 constexpr int RESIDENT_INTERVAL = 5;
 constexpr int RESIDENT_PASSES = 10000;
 constexpr int RESIDENT_REPORT_EVERY = 1000;
@@ -491,32 +487,6 @@ void stepped_sleep() {
     }
 }
 
-// The example control file with the thresholds this benchmark keeps out of reach, and a trend that
-// is never reported: passes that follow each other within milliseconds find every process that
-// grows for a second (a compiler) growing at every step, which passes minutes apart would not.
-// The analysis still walks every row at every snapshot.
-bool write_control_file() {
-    std::ifstream in(std::string(TARN_SOURCE_DIR) + "/examples/telvzopt.trm", std::ios::binary);
-    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    auto replace = [&text](const std::string &keyword, const std::string &value) {
-        size_t at = text.find("\n" + keyword + " ");
-        if (at == std::string::npos) {
-            return false;
-        }
-        size_t end = text.find('\n', at + 1);
-        text.replace(at + 1, end - at - 1, keyword + " " + value);
-        return true;
-    };
-    bool replaced =
-        replace("RSS_MEMORY_THRESHOLD", std::to_string(RSS_OUT_OF_REACH)) &&
-        replace("RSS_ABORT_MEMORY_THRESHOLD", "0") &&
-        replace("CPU_PERCENT_THRESHOLD_QV", std::to_string(APPLIANCE_CPU_OUT_OF_REACH)) &&
-        replace("TREND_ANALYSIS_NUM_INCREASES", std::to_string(TREND_SAMPLES));
-    std::ofstream out(data_file("telvzopt.trm"), std::ios::binary | std::ios::trunc);
-    out << text;
-    return replaced && out.good();
-}
-
 void monitor_resident(benchmark::State &state) {
     idle.resize(0);
     if (TARN_CB_PTR != nullptr) {
@@ -524,7 +494,7 @@ void monitor_resident(benchmark::State &state) {
         return;
     }
     events_at_start = file_size(event_log_path());
-    if (!write_control_file()) {
+    if (!write_long_run_control_file(data_file("telvzopt.trm"))) {
         state.SkipWithError("cannot write the control file into the data directory");
         return;
     }

@@ -69,11 +69,6 @@ constexpr int INTERVAL = 5;
 constexpr long PASSES = 10000;
 constexpr long RECORD_EVERY = 1000;
 constexpr char NAME[] = "tarnmon_resident";
-constexpr int32_t RSS_OUT_OF_REACH = 8000000;
-// Tenths of a percent of the machine: no sum of shares comes near it.
-constexpr int32_t APPLIANCE_CPU_OUT_OF_REACH = 100000;
-// Above the samples the trend keeps: never reported.
-constexpr int TREND_NEVER = 24;
 constexpr int SMAPS_LINES_SHOWN = 16;
 
 std::string read_file(const std::string &path) {
@@ -101,28 +96,6 @@ double seconds_since(const timespec &start) {
     clock_gettime(CLOCK_MONOTONIC, &now);
     return static_cast<double>(now.tv_sec - start.tv_sec) +
            static_cast<double>(now.tv_nsec - start.tv_nsec) / 1e9;
-}
-
-// The example control file with the thresholds this benchmark keeps out of reach.
-bool write_control_file(const std::string &path) {
-    std::string text = read_file(std::string(TARN_SOURCE_DIR) + "/examples/telvzopt.trm");
-    auto replace = [&text](const std::string &keyword, const std::string &value) {
-        size_t at = text.find("\n" + keyword + " ");
-        if (at == std::string::npos) {
-            return false;
-        }
-        size_t end = text.find('\n', at + 1);
-        text.replace(at + 1, end - at - 1, keyword + " " + value);
-        return true;
-    };
-    bool replaced =
-        replace("RSS_MEMORY_THRESHOLD", std::to_string(RSS_OUT_OF_REACH)) &&
-        replace("RSS_ABORT_MEMORY_THRESHOLD", "0") &&
-        replace("CPU_PERCENT_THRESHOLD_QV", std::to_string(APPLIANCE_CPU_OUT_OF_REACH)) &&
-        replace("TREND_ANALYSIS_NUM_INCREASES", std::to_string(TREND_NEVER));
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
-    out << text;
-    return replaced && out.good();
 }
 
 // The events of the event log, one JSON object a line: how many are the informational event of a
@@ -339,7 +312,7 @@ void tarnmon_resident(benchmark::State &state) {
     std::string data = top + "/data";
     std::string recorded = top + "/recorded";
     std::string config = top + "/telvzopt.trm";
-    if (mkdir(recorded.c_str(), 0755) != 0 || !write_control_file(config)) {
+    if (mkdir(recorded.c_str(), 0755) != 0 || !write_long_run_control_file(config)) {
         state.SkipWithError("cannot write the control file");
         return;
     }

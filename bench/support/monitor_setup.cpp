@@ -42,6 +42,28 @@ bool load_example_control_file() {
     return true;
 }
 
+bool write_long_run_control_file(const std::string &path) {
+    std::ifstream in(std::string(TARN_SOURCE_DIR) + "/examples/telvzopt.trm", std::ios::binary);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    auto replace = [&text](const std::string &keyword, const std::string &value) {
+        size_t at = text.find("\n" + keyword + " ");
+        if (at == std::string::npos) {
+            return false;
+        }
+        size_t end = text.find('\n', at + 1);
+        text.replace(at + 1, end - at - 1, keyword + " " + value);
+        return true;
+    };
+    bool replaced =
+        replace("RSS_MEMORY_THRESHOLD", std::to_string(RSS_OUT_OF_REACH)) &&
+        replace("RSS_ABORT_MEMORY_THRESHOLD", "0") &&
+        replace("CPU_PERCENT_THRESHOLD_QV", std::to_string(APPLIANCE_CPU_OUT_OF_REACH)) &&
+        replace("TREND_ANALYSIS_NUM_INCREASES", std::to_string(TREND_SAMPLES));
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << text;
+    return replaced && out.good();
+}
+
 bool set_up_monitor() {
     if (!enter_private_ipc()) {
         return false;
