@@ -225,7 +225,7 @@ TEST_F(SnapshotPlatform, TarnmonRefusesWhatItCannotShow) {
     for (const char *wrong : {"first", "0x1", "1 2", "--file", "-v"}) {
         run_result usage = tarnmon(wrong);
         EXPECT_EQ(usage.status, 2) << wrong;
-        EXPECT_EQ(usage.err, "usage: tarnmon snapshots [--file PATH] [N|last]\n") << wrong;
+        EXPECT_EQ(usage.err, "usage: tarnmon snapshots [--file PATH] [--json] [N|last]\n") << wrong;
     }
     run_result zero = tarnmon("0");
     EXPECT_EQ(zero.status, 3);

@@ -1,6 +1,7 @@
 // tarnmon status, stop, alerts, events, limits and overrides, run as separate processes against a
 // real control block in a private IPC namespace; the command line every command shares; tarnmon
-// snapshots over files that no monitor wrote.
+// snapshots over files that no monitor wrote; the --json output of status, overrides and
+// snapshots, and the JSON writer and its string escaper.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -12,6 +13,9 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
+#include <optional>
+#include <random>
 #include <spawn.h>
 #include <sstream>
 #include <sys/ipc.h>
@@ -25,6 +29,9 @@
 #include "capture/snapshot_file.h"
 #include "core/control_block.h"
 #include "data_blocks.h"
+#include "json_value.h"
+#include "json_writer.h"
+#include "platform_test_support.h"
 #include "private_ipc.h"
 #include "run_command.h"
 
@@ -311,8 +318,9 @@ TEST_F(Tarnmon, EveryCommandTakesHelpAndRefusesWhatItDoesNotKnow) {
 TEST_F(Tarnmon, HelpOfACommandIsItsUsageAndSummary) {
     command_result r = run_command({tarnmon(), "status", "--help"});
     EXPECT_EQ(r.status, 0);
-    EXPECT_EQ(r.out, "usage: tarnmon status\n"
-                     "show the control block of a running monitor\n\n"
+    EXPECT_EQ(r.out, "usage: tarnmon status [--json]\n"
+                     "show the control block of a running monitor\n"
+                     "  --json  print the same as one JSON document\n\n"
                      "exit status: 0 fine, 1 finding, 2 usage error, 3 not available\n");
 }
 
@@ -841,6 +849,444 @@ TEST_F(TarnmonSnapshots, ARegularFileIsListed) {
         << r.out;
     EXPECT_NE(r.out.find("    1  plain "), std::string::npos) << r.out;
     EXPECT_EQ(r.err, "");
+}
+
+// tarnmon status, overrides and snapshots --json: one document on one line, read back by a strict
+// reader and held against the text of the same state, field by field.
+
+// The document that a command printed; a test failure and a null when it is not one JSON document
+// on one line.
+json_value json_of(const command_result &r) {
+    EXPECT_TRUE(r.out.ends_with('\n') && r.out.find('\n') == r.out.size() - 1) << r.out;
+    std::string problem;
+    std::optional<json_value> document = parse_json(r.out, &problem);
+    EXPECT_TRUE(document.has_value()) << problem << "\n" << r.out;
+    return document.value_or(json_value{});
+}
+
+// A command run as text and with --json after its name, over the same state: the JSON form must
+// succeed quietly.
+struct both_forms {
+    command_result text;
+    command_result json;
+    json_value document;
+};
+
+both_forms run_both(std::vector<std::string> words) {
+    both_forms r;
+    r.text = run_command(words);
+    EXPECT_EQ(r.text.status, 0) << r.text.err;
+    words.insert(words.begin() + 2, "--json");
+    r.json = run_command(words);
+    EXPECT_EQ(r.json.status, 0) << r.json.err;
+    EXPECT_EQ(r.json.err, "");
+    r.document = json_of(r.json);
+    return r;
+}
+
+// A text as tarnmon's text forms show it: a "\n\r" line end as "\n", every other control
+// character but tab as "\xhh".
+std::string shown(const std::string &text) {
+    std::string out;
+    for (size_t i = 0; i < text.size(); ++i) {
+        auto c = static_cast<unsigned char>(text[i]);
+        if (c == '\n') {
+            out += '\n';
+            i += text.compare(i + 1, 1, "\r") == 0 ? 1 : 0;
+        } else if ((c < 0x20 && c != '\t') || c == 0x7f) {
+            char escaped[5];
+            std::snprintf(escaped, sizeof escaped, "\\x%02x", c);
+            out += escaped;
+        } else {
+            out += static_cast<char>(c);
+        }
+    }
+    return out;
+}
+
+std::string hex(int64_t number) {
+    char text[32];
+    std::snprintf(text, sizeof text, "0x%08llx", static_cast<unsigned long long>(number));
+    return text;
+}
+
+using names = std::vector<std::string>;
+
+TEST_F(Tarnmon, StatusJsonHoldsWhatTheTextShows) {
+    create_block();
+    block->analysisIndex = 5;
+    block->sleepTimeExceeded = 4294967295u;
+    block->numLoopsBeforeCPUChecking = -2147483647 - 1;
+    block->sleep_time_percent = -1;
+    block->uBufferLock = 3;
+    auto [text, json, doc] = run_both({tarnmon(), "status"});
+    EXPECT_EQ(doc.keys(), (names{"key", "id", "bytes", "attached_processes", "fields"}));
+    std::vector<std::string> lines = platform_test::lines_of(text.out);
+    ASSERT_EQ(lines.size(), 10u) << text.out;
+    EXPECT_EQ(lines[0], "control block " + hex(doc["key"].integer()) + ": id " + doc["id"].number +
+                            ", " + doc["bytes"].number + " bytes, attached by " +
+                            doc["attached_processes"].number + " process(es)");
+    ASSERT_EQ(doc["fields"].items.size(), 9u);
+    for (size_t i = 0; i < 9; ++i) {
+        std::istringstream words(lines[i + 1]);
+        std::string name, number, meaning;
+        words >> name >> number >> std::ws;
+        std::getline(words, meaning);
+        const json_value &field = doc["fields"][i];
+        EXPECT_EQ(field.keys(), (names{"name", "value", "meaning"}));
+        EXPECT_EQ(field["name"].text, name);
+        EXPECT_EQ(field["value"].type, json_value::kind::number);
+        EXPECT_EQ(field["value"].number, number) << name;
+        EXPECT_EQ(field["meaning"].text, meaning);
+    }
+    EXPECT_EQ(doc["fields"][1]["value"].integer(), 4294967295);
+    EXPECT_EQ(doc["fields"][2]["value"].integer(), -2147483648);
+}
+
+TEST_F(Tarnmon, OverridesJsonHoldsWhatTheTextShows) {
+    create_block();
+    create_lock();
+    auto own = static_cast<uint32_t>(getpid());
+    block->override_table[3] = {own, 100, 0, 0, 4194304, 0, 0, 1, 1};
+    block->override_table[4] = {own + 1, 9, 9, 9, 9, 9, 9, 0, 0}; // not in use
+    block->override_table[4999] = {4294967295u, 4294967295u, 1, 2, 3, 4, 5, 1, 0};
+    auto [text, json, doc] = run_both({tarnmon(), "overrides"});
+    EXPECT_EQ(doc.keys(), (names{"key", "in_use", "entries", "unit", "overrides"}));
+    std::vector<std::string> lines = platform_test::lines_of(text.out);
+    ASSERT_EQ(lines.size(), 4u) << text.out;
+    EXPECT_EQ(lines[0], "override table of control block " + hex(doc["key"].integer()) + ": " +
+                            doc["in_use"].number + " of " + doc["entries"].number +
+                            " entries in use (limits in " + doc["unit"].text +
+                            ", 0 = no override)");
+    std::istringstream heading(lines[1]);
+    names columns{std::istream_iterator<std::string>(heading), {}};
+    ASSERT_EQ(doc["overrides"].items.size(), 2u);
+    for (size_t row = 0; row < 2; ++row) {
+        const json_value &entry = doc["overrides"][row];
+        EXPECT_EQ(entry.keys(), columns);
+        std::istringstream cells(lines[row + 2]);
+        for (size_t column = 0; column + 1 < columns.size(); ++column) {
+            std::string cell;
+            cells >> cell;
+            EXPECT_EQ(entry[columns[column]].type, json_value::kind::number);
+            EXPECT_EQ(entry[columns[column]].number, cell) << columns[column];
+        }
+        std::string command;
+        std::getline(cells, command);
+        EXPECT_EQ("  " + shown(entry["command"].text), command);
+    }
+    EXPECT_EQ(doc["overrides"][0]["command"].text, own_command_name());
+    EXPECT_EQ(doc["overrides"][1]["command"].text, "(gone)");
+}
+
+TEST_F(Tarnmon, OverridesJsonOfAnEmptyTable) {
+    create_block();
+    command_result r = run_command({tarnmon(), "overrides", "--json"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "{\"key\":2524086295,\"in_use\":0,\"entries\":5000,\"unit\":\"KB\","
+                     "\"overrides\":[]}\n");
+}
+
+TEST_F(Tarnmon, OverridesJsonEscapesAHostileCommandName) {
+    create_block();
+    create_lock();
+    block->override_table[0] = {static_cast<uint32_t>(getpid()), 1, 0, 0, 0, 0, 0, 1, 0};
+    std::string name = own_command_name();
+    ASSERT_EQ(prctl(PR_SET_NAME, "q\"\\\x01\xff\n\x1b"), 0);
+    command_result r = run_command({tarnmon(), "overrides", "--json"});
+    prctl(PR_SET_NAME, name.c_str());
+    EXPECT_EQ(r.status, 0) << r.err;
+    json_value doc = json_of(r);
+    EXPECT_NE(r.out.find(R"("command":"q\"\\\u0001\u00ff\u000a\u001b"})"), std::string::npos)
+        << r.out;
+    // A byte that is not UTF-8 reads back as the character of its number.
+    EXPECT_EQ(doc["overrides"][0]["command"].text, "q\"\\\x01\xc3\xbf\n\x1b");
+}
+
+TEST_F(Tarnmon, JsonWithoutAMonitorFailsAsTheText) {
+    for (std::string name : {"status", "overrides"}) {
+        command_result text = run_command({tarnmon(), name});
+        command_result json = run_command({tarnmon(), name, "--json"});
+        EXPECT_EQ(json.status, 3) << name;
+        EXPECT_EQ(json.status, text.status) << name;
+        EXPECT_EQ(json.out, "") << name;
+        EXPECT_EQ(json.err, text.err) << name;
+        EXPECT_EQ(run_command({tarnmon(), name, "--json", "extra"}).status, 2) << name;
+    }
+    create_block(100);
+    command_result text = run_command({tarnmon(), "status"});
+    command_result json = run_command({tarnmon(), "status", "--json"});
+    EXPECT_EQ(json.status, 3);
+    EXPECT_EQ(json.out, "");
+    EXPECT_EQ(json.err, text.err);
+}
+
+TEST_F(Tarnmon, JsonIsNamedInTheHelpOfTheCommandsThatTakeIt) {
+    const std::string line = "\n  --json  print the same as one JSON document\n\n";
+    for (std::string name : {"status", "overrides", "snapshots"}) {
+        EXPECT_NE(run_command({tarnmon(), name, "--help"}).out.find(line), std::string::npos)
+            << name;
+    }
+    for (std::string name : {"stop", "alerts", "events", "check-config", "limits", "run"}) {
+        EXPECT_EQ(run_command({tarnmon(), name, "--help"}).out.find("--json"), std::string::npos)
+            << name;
+        command_result r = run_command({tarnmon(), name, "--json"});
+        EXPECT_EQ(r.status, 2) << name;
+        EXPECT_EQ(r.err.rfind("usage: tarnmon " + name, 0), 0u) << r.err;
+    }
+}
+
+// A file of four blocks: a plain snapshot, a problem snapshot with a hostile line and time stamp,
+// text outside any snapshot, and a plain snapshot without a time stamp.
+const std::string HOSTILE_STAMP = "6 \"March\" \\ \x01 2021";
+const std::string HOSTILE_LINE = "ps \"x\\y\x01\x7f\xff\xc3( \xe2\x82\xac\x1b[2J";
+const std::string PLAIN_BLOCK =
+    std::string(PLAIN_SNAPSHOT_OPENING) +
+    "\n\rLocal date and time = 5 March 2021 at 07:04:09 \n\rgathered\n\r" +
+    std::string(PLAIN_SNAPSHOT_CLOSING) + "\n\r";
+const std::string PROBLEM_BLOCK =
+    std::string(PROBLEM_SNAPSHOT_OPENING) + "\n\rLocal date and time = " + HOSTILE_STAMP + " \n\r" +
+    HOSTILE_LINE + "\n\r" + std::string(PROBLEM_SNAPSHOT_CLOSING) + "\n\r";
+const std::string STRAY_TEXT = "left over\n\r";
+const std::string UNSTAMPED_BLOCK = std::string(PLAIN_SNAPSHOT_OPENING) + "\n\rno stamp\n\r" +
+                                    std::string(PLAIN_SNAPSHOT_CLOSING) + "\n\r";
+
+TEST_F(TarnmonSnapshots, JsonListHoldsWhatTheTextListShows) {
+    std::string path = dir + "/telvzmnd.trm";
+    std::ofstream(path, std::ios::binary)
+        << PLAIN_BLOCK + PROBLEM_BLOCK + STRAY_TEXT + UNSTAMPED_BLOCK;
+    auto [text, json, doc] = run_both({tarnmon(), "snapshots"});
+    EXPECT_EQ(doc.keys(), (names{"file", "bytes", "blocks"}));
+    EXPECT_EQ(doc["file"].text, path);
+    std::vector<std::string> lines = platform_test::lines_of(text.out);
+    ASSERT_EQ(lines.size(), 6u) << text.out;
+    EXPECT_EQ(lines[0], doc["file"].text + ": " + doc["bytes"].number + " bytes, " +
+                            std::to_string(doc["blocks"].items.size()) + " blocks");
+    ASSERT_EQ(doc["blocks"].items.size(), 4u);
+    // "%5zu  %-34s  %-34s  %10zu": number, kind, time stamp, bytes.
+    auto trimmed = [](std::string cell) {
+        cell.erase(cell.find_last_not_of(' ') + 1);
+        return cell.substr(cell.find_first_not_of(' '));
+    };
+    for (size_t i = 0; i < 4; ++i) {
+        const std::string &row = lines[i + 2];
+        const json_value &b = doc["blocks"][i];
+        EXPECT_EQ(b.keys(), (names{"number", "kind", "time_stamp", "bytes"}));
+        EXPECT_EQ(b["number"].number, trimmed(row.substr(0, 5)));
+        EXPECT_EQ(b["kind"].text, trimmed(row.substr(7, 34)));
+        std::string stamp =
+            b["time_stamp"].type == json_value::kind::null ? "-" : shown(b["time_stamp"].text);
+        EXPECT_EQ(stamp, trimmed(row.substr(43, row.size() - 43 - 12)));
+        EXPECT_EQ(b["bytes"].number, trimmed(row.substr(row.size() - 10)));
+    }
+    EXPECT_EQ(doc["blocks"][1]["time_stamp"].text, HOSTILE_STAMP);
+    EXPECT_EQ(doc["blocks"][2]["kind"].text, "text outside a snapshot");
+    EXPECT_EQ(doc["blocks"][3]["time_stamp"].type, json_value::kind::null);
+    EXPECT_NE(json.out.find(R"("time_stamp":"6 \"March\" \\ \u0001 2021")"), std::string::npos);
+}
+
+TEST_F(TarnmonSnapshots, JsonOfOneBlockIsItsRowOfTheListWithItsText) {
+    std::string path = dir + "/telvzmnd.trm";
+    const std::string blocks[] = {PLAIN_BLOCK, PROBLEM_BLOCK, STRAY_TEXT, UNSTAMPED_BLOCK};
+    std::ofstream(path, std::ios::binary) << blocks[0] + blocks[1] + blocks[2] + blocks[3];
+    json_value list = json_of(run_command({tarnmon(), "snapshots", "--json"}));
+    for (std::string which : {"1", "2", "3", "4", "last"}) {
+        auto [text, json, doc] = run_both({tarnmon(), "snapshots", which});
+        EXPECT_EQ(doc.keys(), (names{"number", "kind", "time_stamp", "bytes", "text"}));
+        size_t index = which == "last" ? 1 : std::stoul(which) - 1;
+        const json_value &row = list["blocks"][index];
+        for (const std::string &name : row.keys()) {
+            EXPECT_EQ(doc[name].type, row[name].type) << which << " " << name;
+            EXPECT_EQ(doc[name].number, row[name].number) << which << " " << name;
+            EXPECT_EQ(doc[name].text, row[name].text) << which << " " << name;
+        }
+        if (index != 1) {
+            EXPECT_EQ(doc["text"].text, blocks[index]) << which;
+            EXPECT_EQ(shown(doc["text"].text), text.out) << which;
+        }
+    }
+    // The hostile line, escaped to the byte; what is not UTF-8 reads back as the character of its
+    // number.
+    command_result last = run_command({tarnmon(), "snapshots", "last", "--json"});
+    EXPECT_NE(last.out.find("\\u000a\\u000dps \\\"x\\\\y\\u0001\\u007f\\u00ff\\u00c3( "
+                            "\xe2\x82\xac\\u001b[2J\\u000a\\u000d=END FEDC"),
+              std::string::npos)
+        << last.out;
+    EXPECT_NE(
+        json_of(last)["text"].text.find("ps \"x\\y\x01\x7f\xc3\xbf\xc3\x83( \xe2\x82\xac\x1b[2J"),
+        std::string::npos);
+}
+
+TEST_F(TarnmonSnapshots, JsonFailsAsTheText) {
+    std::string path = dir + "/telvzmnd.trm";
+    auto same = [](std::vector<std::string> words, int status) {
+        command_result text = run_command(words);
+        words.insert(words.begin() + 2, "--json");
+        command_result json = run_command(words);
+        EXPECT_EQ(json.status, status) << words.back();
+        EXPECT_EQ(json.status, text.status) << words.back();
+        EXPECT_EQ(json.out, "") << words.back();
+        EXPECT_EQ(json.err, text.err) << words.back();
+        EXPECT_NE(json.err, "") << words.back();
+    };
+    same({tarnmon(), "snapshots"}, 3); // no file
+    same({tarnmon(), "snapshots", "--file", dir}, 3);
+    std::ofstream(path, std::ios::binary) << PLAIN_BLOCK;
+    same({tarnmon(), "snapshots", "2"}, 3);
+    same({tarnmon(), "snapshots", "0"}, 3);
+    same({tarnmon(), "snapshots", "last"}, 3); // no problem snapshot
+    same({tarnmon(), "snapshots", "first"}, 2);
+}
+
+// The escaper and the writer on their own.
+
+// The JSON string of `escaped` read back; a test failure when it is not one.
+std::string read_back(const std::string &escaped) {
+    std::string problem;
+    std::optional<json_value> value = parse_json("\"" + escaped + "\"", &problem);
+    EXPECT_TRUE(value.has_value()) << problem << ": " << escaped;
+    return value ? value->text : "";
+}
+
+// Whether `text` is UTF-8 that a JSON string may hold as it is, by the strict reader: no quote,
+// backslash or control character (C0, DEL, C1).
+bool plain_utf8(const std::string &text) {
+    for (size_t i = 0; i + 1 < text.size(); ++i) {
+        if (text[i] == '\xc2' && static_cast<unsigned char>(text[i + 1]) <= 0x9f) {
+            return false; // U+0080..U+009F, or not UTF-8
+        }
+    }
+    std::string problem;
+    return text.find_first_of("\"\\\x7f") == std::string::npos &&
+           parse_json("\"" + text + "\"", &problem).has_value();
+}
+
+TEST(TarnmonJsonEscaper, EachByteAloneIsKeptOrEscaped) {
+    for (int b = 0; b < 256; ++b) {
+        std::string in(1, static_cast<char>(b));
+        std::string expected = in;
+        if (b == '"' || b == '\\') {
+            expected = "\\" + in;
+        } else if (b < 0x20 || b >= 0x7f) {
+            char u[7];
+            std::snprintf(u, sizeof u, "\\u%04x", b);
+            expected = u;
+        }
+        std::string escaped = json_escaped(in);
+        EXPECT_EQ(escaped, expected) << b;
+        // Above 0x7f a lone byte is not UTF-8: it reads back as the character of its number.
+        std::string back = b < 0x80 ? in
+                                    : std::string{static_cast<char>(0xc0 | (b >> 6)),
+                                                  static_cast<char>(0x80 | (b & 0x3f))};
+        EXPECT_EQ(read_back(escaped), back) << b;
+    }
+}
+
+TEST(TarnmonJsonEscaper, SequencesOfUtf8AreKeptAndTheRestEscaped) {
+    const std::pair<std::string, std::string> cases[] = {
+        {"\xe2\x82\xac", "\xe2\x82\xac"},                     // U+20AC
+        {"\xf0\x9f\x98\x80", "\xf0\x9f\x98\x80"},             // U+1F600
+        {"\xc2\xa0", "\xc2\xa0"},                             // U+00A0, the first after C1
+        {"\xc2\x85", "\\u0085"},                              // C1
+        {"\xc2\x9f", "\\u009f"},                              // C1
+        {"\xc0\x80", "\\u00c0\\u0080"},                       // overlong
+        {"\xe0\x80\xaf", "\\u00e0\\u0080\\u00af"},            // overlong
+        {"\xed\xa0\x80", "\\u00ed\\u00a0\\u0080"},            // a surrogate
+        {"\xf4\x90\x80\x80", "\\u00f4\\u0090\\u0080\\u0080"}, // beyond U+10FFFF
+        {"\xe2\x82", "\\u00e2\\u0082"},                       // cut short
+        {"\xe2\x82x", "\\u00e2\\u0082x"},                     // cut short
+        {"a\xf0\x9f\x98", "a\\u00f0\\u009f\\u0098"},          // cut short at the end
+        {"\xe2\x82\xe2\x82\xac", "\\u00e2\\u0082\xe2\x82\xac"},
+        {"\xf8\x88\x80\x80\x80", "\\u00f8\\u0088\\u0080\\u0080\\u0080"},
+        {std::string("a\0b", 3), "a\\u0000b"},
+    };
+    for (const auto &[in, expected] : cases) {
+        std::string escaped = json_escaped(in);
+        EXPECT_EQ(escaped, expected);
+        read_back(escaped);
+    }
+}
+
+TEST(TarnmonJsonEscaper, AnyBytesGiveAValidStringAndUtf8ReadsBackAsItIs) {
+    auto check = [](const std::string &in) {
+        std::string escaped = json_escaped(in);
+        EXPECT_TRUE(std::none_of(escaped.begin(), escaped.end(), [](char c) {
+            return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
+        }));
+        std::string back = read_back(escaped);
+        if (plain_utf8(in)) {
+            EXPECT_EQ(escaped, in);
+        }
+        return back;
+    };
+    for (int first = 0; first < 256; ++first) {
+        for (int second = 0; second < 256; ++second) {
+            check({static_cast<char>(first), static_cast<char>(second)});
+        }
+    }
+    // Random strings, drawn so that the bytes of UTF-8 sequences come together often.
+    std::mt19937 random(20261124);
+    std::uniform_int_distribution<int> length(0, 12);
+    std::uniform_int_distribution<int> pick(0, 3);
+    std::uniform_int_distribution<int> byte(0, 255);
+    std::uniform_int_distribution<int> continuation(0x80, 0xbf);
+    std::uniform_int_distribution<int> lead(0xc2, 0xf4);
+    std::uniform_int_distribution<int> ascii(0x20, 0x7e);
+    for (int round = 0; round < 200000; ++round) {
+        std::string in;
+        for (int n = length(random); n > 0; --n) {
+            int kind = pick(random);
+            in += static_cast<char>(kind == 0   ? byte(random)
+                                    : kind == 1 ? continuation(random)
+                                    : kind == 2 ? lead(random)
+                                                : ascii(random));
+        }
+        check(in);
+        if (::testing::Test::HasFailure()) {
+            break;
+        }
+    }
+}
+
+TEST(TarnmonJsonWriter, NestsObjectsAndArraysWithTheirCommas) {
+    json_writer json;
+    json.begin_object()
+        .field("a", INT64_MIN)
+        .field("b", UINT64_MAX)
+        .key("c")
+        .begin_array()
+        .begin_object()
+        .end_object()
+        .begin_array()
+        .end_array()
+        .value("x")
+        .null()
+        .value(int32_t{-1})
+        .end_array()
+        .key("d\n")
+        .begin_object()
+        .field("e", "f")
+        .end_object()
+        .end_object();
+    EXPECT_EQ(json.text(), R"({"a":-9223372036854775808,"b":18446744073709551615,)"
+                           R"("c":[{},[],"x",null,-1],"d\u000a":{"e":"f"}})");
+    std::string problem;
+    EXPECT_TRUE(parse_json(json.text(), &problem).has_value()) << problem;
+}
+
+TEST(TarnmonJsonReader, RefusesWhatIsNotStrictJson) {
+    for (std::string wrong :
+         {"", "{", "{\"a\":1,}", "[1,]", "01", "1.", "-", "\"\x01\"", "\"\xff\"", "\"\\ud800\"",
+          "\"\\x41\"", "{\"a\":1,\"a\":2}", "[] []", "{'a':1}", "nul", "\"\xc0\x80\""}) {
+        std::string problem;
+        EXPECT_FALSE(parse_json(wrong, &problem).has_value()) << wrong;
+    }
+    std::string problem;
+    std::optional<json_value> ok =
+        parse_json(" {\"a\":[true,false,null,-0.5e+3,\"\\ud83d\\ude00\\/\"]} \n", &problem);
+    ASSERT_TRUE(ok.has_value()) << problem;
+    EXPECT_EQ((*ok)["a"][4].text, "\xf0\x9f\x98\x80/");
+    EXPECT_EQ((*ok)["a"][3].number, "-0.5e+3");
 }
 
 } // namespace

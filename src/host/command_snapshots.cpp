@@ -1,4 +1,5 @@
-// tarnmon snapshots: lists the blocks of the snapshot file, or shows one of them.
+// tarnmon snapshots: lists the blocks of the snapshot file, or shows one of them; with --json, the
+// same as one JSON document.
 #include <cerrno>
 #include <charconv>
 #include <cstdint>
@@ -16,6 +17,7 @@
 #include "commands.h"
 #include "data_blocks.h"
 #include "descriptor.h"
+#include "json_writer.h"
 #include "linux/environment.h"
 #include "snapshot_reader.h"
 
@@ -79,6 +81,33 @@ bool read_file(const std::string &path, std::string *text, std::string *problem)
     return problem->empty();
 }
 
+// A block as a row of the list shows it: its number, kind, time stamp and size; with `text`, also
+// the block itself as it is in the file (the text form turns it for a terminal).
+void block_json(json_writer &json, size_t index, const snapshot_block &b, bool with_text) {
+    json.begin_object().field("number", index + 1).field("kind", describe(b)).key("time_stamp");
+    if (b.timestamp.empty()) {
+        json.null();
+    } else {
+        json.value(b.timestamp);
+    }
+    json.field("bytes", b.text.size());
+    if (with_text) {
+        json.field("text", b.text);
+    }
+    json.end_object();
+}
+
+// {"file":…,"bytes":…,"blocks":[{"number","kind","time_stamp","bytes"}…]}; a block without a time
+// stamp has null.
+void list_json(const std::string &path, size_t size, const std::vector<snapshot_block> &blocks) {
+    json_writer json;
+    json.begin_object().field("file", path).field("bytes", size).key("blocks").begin_array();
+    for (size_t i = 0; i < blocks.size(); ++i) {
+        block_json(json, i, blocks[i], false);
+    }
+    json.end_array().end_object().print();
+}
+
 void list(const std::string &path, size_t size, const std::vector<snapshot_block> &blocks) {
     std::printf("%s: %zu bytes, %zu block%s\n", path.c_str(), size, blocks.size(),
                 blocks.size() == 1 ? "" : "s");
@@ -121,8 +150,9 @@ bool is_selector(std::string_view which) {
     return which == "last" || which.find_first_not_of("0123456789") == std::string_view::npos;
 }
 
-// Shows what `which` asks for: the list when it is empty, a block otherwise.
-int show(const std::string &path, std::string_view which) {
+// Shows what `which` asks for: the list when it is empty, a block otherwise. In JSON, the block is
+// the object of its row in the list with its "text".
+int show(const std::string &path, std::string_view which, bool json) {
     std::string text;
     std::string problem;
     if (!read_file(path, &text, &problem)) {
@@ -131,13 +161,19 @@ int show(const std::string &path, std::string_view which) {
     }
     std::vector<snapshot_block> blocks = read_snapshots(text);
     if (which.empty()) {
-        list(path, text.size(), blocks);
+        (json ? list_json : list)(path, text.size(), blocks);
         return EXIT_OK;
     }
     size_t index = select(which, blocks, &problem);
     if (index == blocks.size()) {
         std::fprintf(stderr, "tarnmon: %s\n", problem.c_str());
         return EXIT_UNAVAILABLE;
+    }
+    if (json) {
+        json_writer document;
+        block_json(document, index, blocks[index], true);
+        document.print();
+        return EXIT_OK;
     }
     std::string shown = terminal_text(blocks[index].text);
     std::fwrite(shown.data(), 1, shown.size(), stdout);
@@ -154,7 +190,7 @@ int command_snapshots(const command_line &line) {
     std::string path = line.file != nullptr ? line.file : default_path();
     // A file within the bound may still hold more than this host can hold in memory.
     try {
-        return show(path, which);
+        return show(path, which, line.json != nullptr);
     } catch (const std::bad_alloc &) {
         std::fprintf(stderr, "tarnmon: %s\n", cannot("read", path, ENOMEM).c_str());
         return EXIT_UNAVAILABLE;

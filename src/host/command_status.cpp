@@ -1,4 +1,5 @@
-// tarnmon status: the nine fields of the control block, by name.
+// tarnmon status: the nine fields of the control block, by name; with --json, the same as one JSON
+// document.
 #include <cstddef>
 #include <cstdint>
 #include <cstdio>
@@ -6,6 +7,7 @@
 
 #include "commands.h"
 #include "control_block_view.h"
+#include "json_writer.h"
 
 namespace {
 
@@ -37,26 +39,62 @@ constexpr field FIELDS[] = {
      "non-zero = events are raised as informational"},
 };
 
-} // namespace
+uint32_t raw_field(const control_block_view &view, const field &f) {
+    uint32_t raw;
+    std::memcpy(&raw, reinterpret_cast<const unsigned char *>(view.block) + f.offset, sizeof raw);
+    return raw;
+}
 
-int command_status(const command_line &) {
-    control_block_view view = attach_control_block();
-    if (view.block == nullptr) {
-        std::fprintf(stderr, "tarnmon: %s\n", view.problem.c_str());
-        return EXIT_UNAVAILABLE;
-    }
+void print_text(const control_block_view &view) {
     std::printf("control block 0x%08x: id %d, %u bytes, attached by %llu process(es)\n",
                 TARN_CB_KEY, view.id, TARN_CB_SIZE,
                 static_cast<unsigned long long>(view.attached_processes));
-    const auto *base = reinterpret_cast<const unsigned char *>(view.block);
     for (const auto &f : FIELDS) {
-        uint32_t raw;
-        std::memcpy(&raw, base + f.offset, sizeof raw);
+        uint32_t raw = raw_field(view, f);
         if (f.is_signed) {
             std::printf("  %-26s %11d  %s\n", f.name, static_cast<int32_t>(raw), f.meaning);
         } else {
             std::printf("  %-26s %11u  %s\n", f.name, raw, f.meaning);
         }
+    }
+}
+
+// {"key":…,"id":…,"bytes":…,"attached_processes":…,"fields":[{"name","value","meaning"}…]}, the
+// fields in the order of the text.
+void print_json(const control_block_view &view) {
+    json_writer json;
+    json.begin_object()
+        .field("key", TARN_CB_KEY)
+        .field("id", view.id)
+        .field("bytes", TARN_CB_SIZE)
+        .field("attached_processes", view.attached_processes)
+        .key("fields")
+        .begin_array();
+    for (const auto &f : FIELDS) {
+        uint32_t raw = raw_field(view, f);
+        json.begin_object().field("name", f.name).key("value");
+        if (f.is_signed) {
+            json.value(static_cast<int32_t>(raw));
+        } else {
+            json.value(raw);
+        }
+        json.field("meaning", f.meaning).end_object();
+    }
+    json.end_array().end_object().print();
+}
+
+} // namespace
+
+int command_status(const command_line &line) {
+    control_block_view view = attach_control_block();
+    if (view.block == nullptr) {
+        std::fprintf(stderr, "tarnmon: %s\n", view.problem.c_str());
+        return EXIT_UNAVAILABLE;
+    }
+    if (line.json != nullptr) {
+        print_json(view);
+    } else {
+        print_text(view);
     }
     detach_control_block(view);
     return EXIT_OK;

@@ -21,6 +21,9 @@ inline constexpr int EXIT_NOT_FOUND = 127;      // there is no such program
 struct command_line {
     std::vector<const char *> operands;
     const char *file = nullptr; // --file PATH, for the commands that take it
+    // --json, for the commands that take it: their output as one JSON document. Holds the
+    // option's own word; null when not given.
+    const char *json = nullptr;
     // The options of `run`, as given; null when not given. --once takes no value: it holds the
     // option's own word.
     const char *interval = nullptr;

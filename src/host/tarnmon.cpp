@@ -17,11 +17,16 @@ constexpr value_option RUN_OPTIONS[] = {
     {"--once", "", &command_line::once},
 };
 constexpr std::span<const value_option> NO_OPTIONS;
+// Taken by the commands that print what they found as a table or a listing; their --help says
+// what it does on a line of its own.
+constexpr value_option JSON_OPTION = {"--json", "", &command_line::json};
+constexpr const char *JSON_HELP = "  --json  print the same as one JSON document\n";
 
 struct command {
     std::string_view name;
     int (*run)(const command_line &line);
     std::span<const value_option> options;
+    bool takes_json;            // JSON_OPTION too
     std::string_view arguments; // what follows the options in its usage
     std::string_view summary;
     size_t max_operands;
@@ -32,25 +37,25 @@ struct command {
 };
 
 constexpr command COMMANDS[] = {
-    {"status", command_status, NO_OPTIONS, "", "show the control block of a running monitor", 0,
-     false, ""},
-    {"stop", command_stop, NO_OPTIONS, "", "ask the running monitor to end after its pass", 0,
-     false, ""},
-    {"alerts", command_alerts, NO_OPTIONS, "on|off|trigger",
+    {"status", command_status, NO_OPTIONS, true, "", "show the control block of a running monitor",
+     0, false, ""},
+    {"stop", command_stop, NO_OPTIONS, false, "", "ask the running monitor to end after its pass",
+     0, false, ""},
+    {"alerts", command_alerts, NO_OPTIONS, false, "on|off|trigger",
      "switch the running monitor's CPU alerts on or off, or force its sleep alert", 1, false, ""},
-    {"events", command_events, NO_OPTIONS, "info|error",
+    {"events", command_events, NO_OPTIONS, false, "info|error",
      "raise the running monitor's events as informational or as errors", 1, false, ""},
-    {"check-config", command_check_config, NO_OPTIONS, "[FILE]",
+    {"check-config", command_check_config, NO_OPTIONS, false, "[FILE]",
      "check a control file as the monitor would read it", 1, false, ""},
-    {"snapshots", command_snapshots, FILE_OPTION, "[N|last]",
+    {"snapshots", command_snapshots, FILE_OPTION, true, "[N|last]",
      "list the snapshot file, or show snapshot N or the last problem one", 1, false, ""},
-    {"limits", command_limits, LIMIT_OPTIONS, "-- COMMAND [ARGS]",
+    {"limits", command_limits, LIMIT_OPTIONS, false, "-- COMMAND [ARGS]",
      "run COMMAND under memory limits of its own (KB, 0..4194304; 0 = the default)", SIZE_MAX, true,
      "once COMMAND runs, the exit status is its own; 126 COMMAND cannot be run, 127 no such "
      "COMMAND\n"},
-    {"overrides", command_overrides, NO_OPTIONS, "",
+    {"overrides", command_overrides, NO_OPTIONS, true, "",
      "list the memory limits that processes set for themselves", 0, false, ""},
-    {"run", command_run, RUN_OPTIONS, "",
+    {"run", command_run, RUN_OPTIONS, false, "",
      "run the monitor here until SIGINT, SIGTERM or tarnmon stop (--once: one pass)", 0, false,
      "run: 0 once the monitor has ended (its pass done, or stopped); check-config's status for a\n"
      "control file that check-config refuses; 1 the monitor returned a failure of its own; 3 also\n"
@@ -60,7 +65,7 @@ constexpr command COMMANDS[] = {
 constexpr const char *EXIT_STATUSES =
     "exit status: 0 fine, 1 finding, 2 usage error, 3 not available\n";
 
-// "snapshots [--file PATH] [N|last]": the command as its usage shows it.
+// "snapshots [--file PATH] [--json] [N|last]": the command as its usage shows it.
 std::string synopsis(const command &c) {
     std::string text(c.name);
     for (const auto &option : c.options) {
@@ -70,6 +75,11 @@ std::string synopsis(const command &c) {
             text += ' ';
             text += option.placeholder;
         }
+        text += ']';
+    }
+    if (c.takes_json) {
+        text += " [";
+        text += JSON_OPTION.name;
         text += ']';
     }
     if (!c.arguments.empty()) {
@@ -85,8 +95,9 @@ void print_usage(FILE *out, const command &c) {
 
 void print_help(const command &c) {
     print_usage(stdout, c);
-    std::printf("%.*s\n\n%s%.*s", static_cast<int>(c.summary.size()), c.summary.data(),
-                EXIT_STATUSES, static_cast<int>(c.exit_note.size()), c.exit_note.data());
+    std::printf("%.*s\n%s\n%s%.*s", static_cast<int>(c.summary.size()), c.summary.data(),
+                c.takes_json ? JSON_HELP : "", EXIT_STATUSES, static_cast<int>(c.exit_note.size()),
+                c.exit_note.data());
 }
 
 void print_commands(FILE *out) {
@@ -113,7 +124,7 @@ const value_option *option_named(const command &c, std::string_view word) {
             return &option;
         }
     }
-    return nullptr;
+    return c.takes_json && word == JSON_OPTION.name ? &JSON_OPTION : nullptr;
 }
 
 // Sorts the words after the command's name into `line`. "--" ends the options, so that an operand
