@@ -8,6 +8,7 @@ packages=(
   libgtest-dev libgmock-dev googletest libbenchmark-dev
   binutils procps util-linux coreutils git
   openjdk-17-jdk-headless
+  dpkg-dev file # dpkg-shlibdeps and the ELF files of the package that tools/package.sh builds
 )
 
 missing=()

@@ -57,7 +57,9 @@ namespace {
 
 constexpr const char *LIBRARY = "libtelvzmnd.so";
 constexpr const char *APPLIANCE_PROGRAM = "runAsRoot"; // the one program the monitor finds on PATH
-constexpr const char *OWN_LIBEXEC = "libexec"; // where the build puts the programs beside tarnmon
+// Where tarnmon looks for the appliance programs, from its own directory: beside it in the build,
+// and where the install puts them.
+constexpr const char *OWN_LIBEXEC[] = {"libexec", TARN_INSTALLED_LIBEXEC};
 constexpr const char *EVENT_LOG_VARIABLE = "TELV_EVENT_LOG";
 constexpr const char *TRACE_FILE_VARIABLE = "TELV_TRACE_FILE";
 constexpr const char *EVENT_LOG_NAME = "telvzmnd.events";
@@ -338,16 +340,22 @@ std::string settle_appliance_programs() {
     if (!found.empty()) {
         return terminal_text(found) + " (from PATH)";
     }
-    std::string libexec = own_directory() + "/" + OWN_LIBEXEC;
-    setenv("PATH", (libexec + ":" + path).c_str(), 1);
-    std::string own = libexec + "/" + APPLIANCE_PROGRAM;
-    if (is_program(own)) {
-        return terminal_text(own) + " (this tarnmon's, put first on PATH)";
+    std::string looked_in;
+    for (const char *place : OWN_LIBEXEC) {
+        std::string libexec = own_directory() + "/" + place;
+        std::string own = libexec + "/" + APPLIANCE_PROGRAM;
+        if (is_program(own)) {
+            libexec = absolute(libexec.c_str()); // without the ".." of the installed layout
+            own = libexec + "/" + APPLIANCE_PROGRAM;
+            setenv("PATH", (libexec + ":" + path).c_str(), 1);
+            return terminal_text(own) + " (this tarnmon's, put first on PATH)";
+        }
+        looked_in += (looked_in.empty() ? "" : " or ") + terminal_text(libexec);
     }
     std::fprintf(stderr,
                  "tarnmon: no %s on PATH, nor in %s: the monitor runs without the appliance "
                  "programs (no descriptor listing, no clean-up, no trace dump)\n",
-                 APPLIANCE_PROGRAM, terminal_text(libexec).c_str());
+                 APPLIANCE_PROGRAM, looked_in.c_str());
     return "none";
 }
 
