@@ -9,6 +9,7 @@ packages=(
   binutils procps util-linux coreutils git
   openjdk-17-jdk-headless
   dpkg-dev file # dpkg-shlibdeps and the ELF files of the package that tools/package.sh builds
+  man-db groff-base # man -l and groff, which the tests of the manual pages format them with
 )
 
 missing=()
