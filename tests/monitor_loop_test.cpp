@@ -27,6 +27,7 @@
 #include "core/control_block.h"
 #include "core/control_file.h"
 #include "core/monitor_loop.h"
+#include "core/pass_figures.h"
 #include "core/problem_reporting.h"
 #include "core/reason_codes.h"
 #include "core/settings.h"
@@ -848,6 +849,157 @@ TEST_F(MonitorLoop, NoDriftIsFlaggedWhileTheCountdownRuns) {
 } // namespace
 
 namespace {
+
+// ---- The figures of a pass ----
+
+// Every pass's figures, as the observer was handed them.
+std::vector<tarn_pass_figures> figures_seen;
+
+void keep_figures(const tarn_pass_figures *figures, void *context) {
+    static_cast<std::vector<tarn_pass_figures> *>(context)->push_back(*figures);
+}
+
+class MonitorLoopFigures : public MonitorLoop {
+  protected:
+    void SetUp() override {
+        MonitorLoop::SetUp();
+        figures_seen.clear();
+        tarn_observe_passes(keep_figures, &figures_seen);
+    }
+    void TearDown() override {
+        tarn_observe_passes(nullptr, nullptr);
+        MonitorLoop::TearDown();
+    }
+
+    // The figures of `mount_point` in a pass; null when the pass has none.
+    static const tarn_partition_figures *partition(const tarn_pass_figures &figures,
+                                                   const std::string &mount_point) {
+        for (uint32_t i = 0; i < figures.partition_count; ++i) {
+            if (figures.partitions[i].mount_point == mount_point) {
+                return &figures.partitions[i];
+            }
+        }
+        return nullptr;
+    }
+};
+
+TEST_F(MonitorLoopFigures, EachPassHandsTheObserverWhatItsChecksComputedAndWhatItFound) {
+    write_control(quiet_control::text({}));
+    set_df(df_space(95)); // "/" by space: 950 over 900, reported, then held back
+    // One second of the machine's time a sleep; init uses a fifth of it as user, a tenth as kernel.
+    on_sleep = [this](int count) {
+        tree->advance(100);
+        if (count == 5) {
+            tree->set_process(1, "init", 1 + 100, 1 + 50);
+            TARN_CB_PTR->terminateRequest = 1;
+        }
+    };
+    step = 2; // each second of the sleep takes two
+    run_monitor({"5"});
+    ASSERT_EQ(figures_seen.size(), 2u);
+
+    const tarn_pass_figures &first = figures_seen[0];
+    EXPECT_EQ(first.pass, 1u);
+    EXPECT_EQ(first.reason_code, SLASH_SPACE);
+    EXPECT_EQ(first.finding_held_back, 0u);
+    EXPECT_EQ(first.memory_known, 1u);
+    EXPECT_EQ(first.memory_tenths, 200); // 200,000 KB of 1,000,000 in use
+    EXPECT_EQ(first.descriptors_known, 1u);
+    EXPECT_EQ(first.descriptors_tenths, 10); // 1,000 handles of 100,000
+    EXPECT_EQ(first.cpu_known, 0u);          // no sample before the first
+    EXPECT_EQ(first.sleep_known, 0u);        // no sleep before the first
+    EXPECT_GT(first.duration_ns, 0u);
+    ASSERT_EQ(first.partition_count, 2u);
+    EXPECT_STREQ(first.partitions[0].mount_point, "/");
+    EXPECT_EQ(first.partitions[0].space_tenths, 950);
+    EXPECT_EQ(first.partitions[0].inodes_tenths, 100);
+    EXPECT_STREQ(first.partitions[1].mount_point, "/extra");
+    EXPECT_EQ(first.partitions[1].space_tenths, 100);
+    EXPECT_EQ(first.partitions[1].inodes_tenths, TARN_FIGURE_NONE); // no inode line for it
+    EXPECT_EQ(first.partition_lines_dropped, 0u);
+
+    const tarn_pass_figures &second = figures_seen[1];
+    EXPECT_EQ(second.pass, 2u);
+    EXPECT_EQ(second.reason_code, 0);
+    EXPECT_EQ(second.finding_held_back, 1u);
+    EXPECT_EQ(second.cpu_known, 1u);
+    EXPECT_EQ(second.cpu_user_percent, 20.0f);
+    EXPECT_EQ(second.cpu_kernel_percent, 10.0f);
+    EXPECT_EQ(second.sleep_known, 1u);
+    EXPECT_EQ(second.sleep_seconds, 10); // five seconds asked, ten taken
+    EXPECT_EQ(second.sleep_interval, 5);
+    EXPECT_EQ(second.partition_count, 2u);
+    EXPECT_EQ(rec::events().size(), 1u);
+}
+
+TEST_F(MonitorLoopFigures, FiguresThatNoCommandGaveAreLeftUnknown) {
+    write_control(quiet_control::text({}));
+    fakes.add("free", "#!/bin/sh\nexit 1\n");
+    fakes.add("cat", "#!/bin/sh\nexit 1\n");
+    // The headings, a line too short to name its partition, and a file system without inodes.
+    set_df("Filesystem     Type      Size  Used Avail Use% Mounted on\n"
+           "/dev/vda1      ext4       20G\n",
+           "Filesystem      Inodes  IUsed   IFree IUse% Mounted on\n"
+           "tmpfs               0      0       0     - /run\n");
+    EXPECT_EQ(run_once(), 0u);
+    ASSERT_EQ(figures_seen.size(), 1u);
+    const tarn_pass_figures &only = figures_seen[0];
+    EXPECT_EQ(only.memory_known, 0u);
+    EXPECT_EQ(only.descriptors_known, 0u);
+    EXPECT_EQ(only.partition_count, 0u);
+    EXPECT_EQ(only.reason_code, 0);
+    EXPECT_EQ(only.finding_held_back, 0u);
+}
+
+TEST_F(MonitorLoopFigures, PartitionsBeyondTheTableAreCountedAndLongMountPointsCut) {
+    write_control(quiet_control::text({}));
+    std::string space = "Filesystem     Type      Size  Used Avail Use% Mounted on\n";
+    std::string inodes = "Filesystem      Inodes  IUsed   IFree IUse% Mounted on\n";
+    const std::string long_name = "/" + std::string(300, 'm');
+    space += "/dev/long ext4 1G 1G 0G 7% " + long_name + "\n";
+    for (uint32_t i = 0; i < TARN_PARTITIONS_KEPT + 2; ++i) {
+        space += "/dev/p" + std::to_string(i) + " ext4 1G 1G 0G 1% /p" + std::to_string(i) + "\n";
+    }
+    // The inode run lists them the other way round, and repeats one.
+    for (uint32_t i = TARN_PARTITIONS_KEPT + 2; i-- > 0;) {
+        inodes += "/dev/p" + std::to_string(i) + " 10 3 7 30% /p" + std::to_string(i) + "\n";
+    }
+    inodes += "/dev/p5 10 4 6 40% /p5\n";
+    set_df(space, inodes);
+    EXPECT_EQ(run_once(), 0u);
+    ASSERT_EQ(figures_seen.size(), 1u);
+    const tarn_pass_figures &only = figures_seen[0];
+    ASSERT_EQ(only.partition_count, TARN_PARTITIONS_KEPT);
+    // The words of a line are cut at 249 characters before any figure is taken of them.
+    EXPECT_EQ(std::string(only.partitions[0].mount_point), long_name.substr(0, 249));
+    EXPECT_EQ(only.partitions[0].space_tenths, 70);
+    EXPECT_EQ(only.partitions[0].inodes_tenths, TARN_FIGURE_NONE);
+    // 63 of the 66 fit after it: three space lines and three inode lines left out.
+    EXPECT_EQ(only.partition_lines_dropped, 6u);
+    const tarn_partition_figures *p5 = partition(only, "/p5");
+    ASSERT_NE(p5, nullptr);
+    EXPECT_EQ(p5->space_tenths, 10);
+    EXPECT_EQ(p5->inodes_tenths, 400); // the later line of the same partition
+    const tarn_partition_figures *p62 = partition(only, "/p62");
+    ASSERT_NE(p62, nullptr);
+    EXPECT_EQ(p62->inodes_tenths, 300);
+    EXPECT_EQ(partition(only, "/p63"), nullptr);
+}
+
+TEST_F(MonitorLoopFigures, AnObserverTakenAwayIsNotCalledAndAReplacedOneNoMore) {
+    write_control(quiet_control::text({}));
+    std::vector<tarn_pass_figures> other;
+    tarn_observe_passes(keep_figures, &other);
+    EXPECT_EQ(run_once(), 0u);
+    EXPECT_EQ(other.size(), 1u);
+    EXPECT_TRUE(figures_seen.empty());
+    tarn_observe_passes(nullptr, nullptr);
+    fresh_monitor::reset();
+    write_control(quiet_control::text({}));
+    EXPECT_EQ(run_once(), 0u);
+    EXPECT_EQ(other.size(), 1u);
+    EXPECT_TRUE(figures_seen.empty());
+}
 
 // ---- Stopping, and a long run ----
 

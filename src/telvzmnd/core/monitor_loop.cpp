@@ -1,5 +1,6 @@
 #include "core/monitor_loop.h"
 
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
@@ -10,6 +11,7 @@
 #include "core/alert_switches.h"
 #include "core/control_block.h"
 #include "core/control_file.h"
+#include "core/pass_figures.h"
 #include "core/problem_reporting.h"
 #include "core/reason_codes.h"
 #include "core/settings.h"
@@ -61,6 +63,10 @@ struct monitor_run {
     int32_t runOnce = 0;
     int32_t keepRunning = 1;
     int32_t NumIterationsSinceLastSnapshot = 0;
+    uint64_t passes = 0;
+    // The sleep before the pass, for the pass's figures: measured by its last second.
+    bool slept = false;
+    int32_t sleep_seconds = 0;
     filesvc_handle_t handle = 0;
     tarn_control_block *block = nullptr;
 };
@@ -217,13 +223,15 @@ void write_plain_snapshot() {
 
 // Sleeps the checking interval one second at a time. Once CPU checking is armed, a sleep that is
 // to take longer than allowed (it is measured against the uptime after every second) is ended at
-// once and flagged for the performance check of the next pass.
-void sleep_measured(tarn_control_block &block) {
+// once and flagged for the performance check of the next pass. True when a second was measured.
+bool sleep_measured(tarn_control_block &block) {
     tracesvc_trace("TARNMNDF: about to sleep for %d seconds", checking_interval);
     long start = uptime_source();
     int32_t secondsLeft = checking_interval;
     write_field(block.sleep_time_percent, -1);
+    bool measured = false;
     while (secondsLeft != 0 && read_field(block.sleepTimeExceeded) == 0) {
+        measured = true;
         one_second_sleep();
         --secondsLeft;
         tracesvc_trace("TARNMNDF: slept for 1 second; %d seconds left", secondsLeft);
@@ -247,10 +255,23 @@ void sleep_measured(tarn_control_block &block) {
                            percent);
         }
     }
+    return measured;
+}
+
+// What the pass found and how long it took, with what the checks noted, to the observer.
+void publish_figures(const monitor_run &run, std::chrono::steady_clock::time_point started) {
+    auto took = std::chrono::steady_clock::now() - started;
+    bool held_back = run.takeLogCrc == static_cast<int32_t>(TAKE_LOG_SUPPRESSED);
+    publish_pass_figures(
+        {static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(took).count()),
+         held_back ? 0 : run.takeLogCrc, held_back, run.slept, run.sleep_seconds,
+         checking_interval});
 }
 
 void run_pass(monitor_run &run) {
+    auto started = std::chrono::steady_clock::now();
     tracesvc_trace("TARNMNDF: inside while loop");
+    start_pass_figures(++run.passes);
     start_pass_data();
     run.takeLogCrc = 0;
     run.takeLogValue = 0;
@@ -283,12 +304,14 @@ void run_pass(monitor_run &run) {
         write_plain_snapshot();
         run.NumIterationsSinceLastSnapshot = 0;
     }
+    publish_figures(run, started);
 
     if (run.runOnce == 1 || read_field(run.block->terminateRequest) == 1) {
         run.keepRunning = 0;
     }
     if (run.src == 0 && run.keepRunning == 1) {
-        sleep_measured(*run.block);
+        run.slept = sleep_measured(*run.block);
+        run.sleep_seconds = telvzmnd_sleep_time;
     }
 }
 

@@ -5,6 +5,7 @@
 
 #include "command_runner.h"
 #include "core/check_contract.h"
+#include "core/pass_figures.h"
 #include "core/settings.h"
 #include "core/words.h"
 #include "data_blocks.h"
@@ -81,6 +82,7 @@ void check_free(const system_memory_pass &pass) {
     if (figures.memtotal != 0) {
         int32_t percent = memory_percent(figures, in_use);
         tracesvc_trace("TARNMNDD: computed percent is %d (dec, scaled by 10)", percent);
+        note_memory_percent(percent);
         judge_percent(pass, percent);
     }
 }

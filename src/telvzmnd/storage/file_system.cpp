@@ -4,6 +4,7 @@
 
 #include "command_runner.h"
 #include "core/check_contract.h"
+#include "core/pass_figures.h"
 #include "core/settings.h"
 #include "core/words.h"
 #include "data_blocks.h"
@@ -91,6 +92,13 @@ const df_layout &layout_of(df_pass kind) {
 
 bool begins_with(const char *text, const char *prefix) {
     return std::strncmp(text, prefix, std::strlen(prefix)) == 0;
+}
+
+// df's percentage of a partition, as opposed to its heading ("Use%") or the "-" of a file system
+// without inodes.
+bool is_percentage(const char *word) {
+    size_t length = std::strlen(word);
+    return length > 1 && word[0] >= '0' && word[0] <= '9' && word[length - 1] == '%';
 }
 
 const known_partition *known_partition_of(const char *mount_point) {
@@ -212,12 +220,17 @@ void df_line(const file_system_pass &pass, df_pass kind, const char *text) {
         tracesvc_trace("TARNMNDD: ps data: [%s]", text);
     }
     append_data_line(text);
-    split_words(text, layout.word_count);
+    int found = split_words(text, layout.word_count);
     // df's whole percentage, read up to its "%", in tenths as the thresholds are.
     int32_t used = wrap32(int64_t{read_number(words[layout.use_word])} * 10);
     const char *mount_point = words[layout.mount_word];
     if (space) {
         tracesvc_trace("TARNMNDD: words[6] = [%s]", mount_point);
+    }
+    // Figures only of a line with a percentage and a mount point of its own; a short line keeps
+    // the words of the line before it.
+    if (found > layout.mount_word && is_percentage(words[layout.use_word])) {
+        note_partition_use(space, mount_point, used);
     }
     const known_partition *row = known_partition_of(mount_point);
     if (row == nullptr) {

@@ -6,6 +6,7 @@
 
 #include "command_runner.h"
 #include "core/check_contract.h"
+#include "core/pass_figures.h"
 #include "core/settings.h"
 #include "core/words.h"
 #include "data_blocks.h"
@@ -130,6 +131,7 @@ void file_nr_line(const open_files_pass &pass, const char *text) {
         tracesvc_trace("TARNMNDF: maximum open file descriptors is 0, no share computed");
         return;
     }
+    note_descriptor_share(*share);
     if (*share <= file_descriptors_percent_threshold ||
         !finding_to_report(pass.takeLogCrc, pass.tookLog)) {
         return;
