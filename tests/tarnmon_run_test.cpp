@@ -30,6 +30,7 @@
 #include "example_control_file.h"
 #include "fake_commands.h"
 #include "private_ipc.h"
+#include "prometheus_text.h"
 #include "run_command.h"
 
 extern char **environ;
@@ -280,7 +281,8 @@ class TarnmonRun : public ::testing::Test {
 };
 
 const std::string RUN_USAGE =
-    "usage: tarnmon run [--interval SECONDS] [--data-dir DIR] [--config FILE] [--once]\n";
+    "usage: tarnmon run [--interval SECONDS] [--data-dir DIR] [--config FILE] [--once] "
+    "[--metrics FILE]\n";
 
 // ---- One pass ----
 
@@ -742,6 +744,103 @@ TEST_F(TarnmonRun, EveryRunInTheSameNamespaceRuns) {
         EXPECT_NE(id, -1);
         EXPECT_NE(id, 0);
     }
+    EXPECT_EQ(events(), "");
+}
+
+// ---- The metrics file ----
+
+// A process over the example's log limit for appserver (1,500,000 KB resident), and under its
+// abort limit: reported with 0xE111, killed never.
+const std::string PS_WITH_A_LARGE_APPSERVER =
+    QUIET_PS + " 4243  4243  2000000  30000  4000 appserver       00:00:02\n";
+
+TEST_F(TarnmonRun, MetricsOfAPassWithAFindingShowItAndTheHostsFigures) {
+    fakes.add_printing("ps", PS_WITH_A_LARGE_APPSERVER);
+    const std::string metrics = user_dir + "/telvzmnd.prom";
+    running_tarnmon monitor({"--once", "--config", example::path(), "--metrics", metrics});
+    EXPECT_EQ(monitor.wait(PASS_LIMIT), 0) << monitor.err();
+    EXPECT_EQ(monitor.err(), "");
+    EXPECT_NE(monitor.out().find("\nmetrics: " + metrics + ", after every pass\n"),
+              std::string::npos)
+        << monitor.out();
+    EXPECT_NE(events().find("\"reason\":\"0xE111\""), std::string::npos) << events();
+
+    auto read = prometheus::parse(read_file(metrics));
+    ASSERT_EQ(read.error, "") << read_file(metrics);
+    const prometheus::document &doc = read.doc;
+    EXPECT_EQ(doc.value("telvzmnd_passes_total"), 1.0);
+    EXPECT_EQ(doc.value("telvzmnd_findings_total", {{"reason_code", "0xE111"}}), 1.0);
+    EXPECT_EQ(doc.samples_of("telvzmnd_findings_total").size(), 1u);
+    EXPECT_EQ(doc.value("telvzmnd_findings_held_back_total"), 0.0);
+    // The host's own free, file-nr and df gave their figures; one pass has no CPU sample to
+    // compare with, and no sleep before it.
+    auto memory = doc.value("telvzmnd_memory_in_use_percent");
+    ASSERT_TRUE(memory.has_value());
+    EXPECT_GT(*memory, 0.0);
+    EXPECT_LE(*memory, 100.0);
+    EXPECT_TRUE(doc.value("telvzmnd_file_descriptors_in_use_percent").has_value());
+    EXPECT_FALSE(doc.samples_of("telvzmnd_partition_used_percent").empty());
+    EXPECT_TRUE(doc.samples_of("telvzmnd_appliance_cpu_percent").empty());
+    EXPECT_FALSE(doc.value("telvzmnd_sleep_drift_seconds").has_value());
+    EXPECT_GT(*doc.value("telvzmnd_pass_duration_seconds"), 0.0);
+    double now = static_cast<double>(std::time(nullptr));
+    EXPECT_NEAR(*doc.value("telvzmnd_last_pass_timestamp_seconds"), now, PASS_LIMIT.count());
+    // Only the file itself is left where it was written.
+    std::vector<std::string> names;
+    for (const auto &entry : std::filesystem::directory_iterator(user_dir)) {
+        names.push_back(entry.path().filename().string());
+    }
+    EXPECT_EQ(names, std::vector<std::string>{"telvzmnd.prom"});
+}
+
+TEST_F(TarnmonRun, MetricsFileIsReplacedWholeAfterEveryPass) {
+    const std::string metrics = user_dir + "/telvzmnd.prom";
+    running_tarnmon monitor({"--interval", "5", "--config", example::path(), "--metrics", metrics});
+    // Read as a collector reads it, as often as it can, until the third pass has written it.
+    int reads = 0;
+    std::set<ino_t> files;
+    std::string error;
+    double passes = 0;
+    wait_until(
+        [&] {
+            struct stat st;
+            std::string text = read_file(metrics);
+            if (text.empty() || stat(metrics.c_str(), &st) != 0) {
+                return false;
+            }
+            files.insert(st.st_ino);
+            ++reads;
+            auto read = prometheus::parse(text);
+            if (!read.error.empty()) {
+                error = read.error + " in:\n" + text;
+                return true;
+            }
+            passes = read.doc.value("telvzmnd_passes_total").value_or(0);
+            return passes >= 3;
+        },
+        PASS_LIMIT);
+    kill(monitor.pid, SIGTERM);
+    EXPECT_EQ(monitor.wait(PASS_LIMIT), 0) << monitor.err();
+    EXPECT_EQ(error, "");
+    EXPECT_GE(passes, 3.0);
+    EXPECT_GE(files.size(), 2u); // a new file each pass, not the old one rewritten
+    auto last = prometheus::parse(read_file(metrics));
+    ASSERT_EQ(last.error, "");
+    // From the second pass on: the sleep before it, and the CPU of every process.
+    EXPECT_TRUE(last.doc.value("telvzmnd_sleep_drift_seconds").has_value());
+    EXPECT_EQ(last.doc.samples_of("telvzmnd_appliance_cpu_percent").size(), 2u);
+    EXPECT_GT(reads, 0);
+}
+
+TEST_F(TarnmonRun, MetricsFileThatCannotBeWrittenIsRefusedBeforeTheMonitorRuns) {
+    for (const std::string &place : {user_dir + "/missing/telvzmnd.prom", user_dir}) {
+        command_result r = run({"--once", "--config", example::path(), "--metrics", place});
+        EXPECT_EQ(r.status, 3) << place;
+        EXPECT_EQ(r.out, "") << place;
+        EXPECT_EQ(r.err, "tarnmon: cannot write the metrics file " + place + ": " +
+                             std::strerror(place == user_dir ? EISDIR : ENOENT) + "\n");
+    }
+    EXPECT_FALSE(control_block_exists());
     EXPECT_EQ(events(), "");
 }
 

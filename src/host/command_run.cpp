@@ -39,6 +39,7 @@
 #include "core/control_file.h"
 #include "descriptor.h"
 #include "linux/environment.h"
+#include "metrics_file.h"
 #include "snapshot_reader.h"
 
 #ifdef __has_feature
@@ -69,6 +70,7 @@ constexpr int32_t INTERVAL_DEFAULT = 60;
 
 using monitor_main = uint32_t (*)(int32_t, char **);
 using terminate_call = void (*)();
+using observe_call = void (*)(tarn_pass_observer, void *);
 
 // ---- The sleep that a stop cuts short ----
 
@@ -364,6 +366,7 @@ std::string settle_appliance_programs() {
 struct monitor_library {
     monitor_main main = nullptr;
     terminate_call terminate = nullptr;
+    observe_call observe = nullptr;
     std::string path;
 };
 
@@ -380,6 +383,7 @@ bool load_library(monitor_library *library) {
     library->main = reinterpret_cast<monitor_main>(::dlsym(handle, "tarn_mon_main"));
     library->terminate =
         reinterpret_cast<terminate_call>(::dlsym(handle, "tarn_terminate_monitoring"));
+    library->observe = reinterpret_cast<observe_call>(::dlsym(handle, "tarn_observe_passes"));
     link_map *map = nullptr;
     if (::dlinfo(handle, RTLD_DI_LINKMAP, &map) == 0 && map != nullptr && map->l_name != nullptr) {
         library->path = absolute(map->l_name);
@@ -489,6 +493,14 @@ int command_run(const command_line &line) {
     if (!settle_data_directory(line, &directory)) {
         return EXIT_UNAVAILABLE;
     }
+    std::string metrics_path;
+    if (line.metrics != nullptr) {
+        if (int error = settle_replaceable_file(line.metrics, &metrics_path); error != 0) {
+            std::fprintf(stderr, "tarnmon: cannot write the metrics file %s: %s\n",
+                         terminal_text(line.metrics).c_str(), std::strerror(error));
+            return EXIT_UNAVAILABLE;
+        }
+    }
     int32_t file_interval = INTERVAL_DEFAULT;
     int verdict = check_control_file(line.config, check_report::verdict, &file_interval);
     std::fflush(stdout);
@@ -522,6 +534,11 @@ int command_run(const command_line &line) {
     }
     monitor_library library;
     if (!load_library(&library)) {
+        return EXIT_UNAVAILABLE;
+    }
+    if (line.metrics != nullptr && library.observe == nullptr) {
+        std::fprintf(stderr, "tarnmon: %s gives no figures of its passes (tarn_observe_passes)\n",
+                     terminal_text(library.path).c_str());
         return EXIT_UNAVAILABLE;
     }
 
@@ -563,6 +580,11 @@ int command_run(const command_line &line) {
     std::printf("trace: %s\n",
                 terminal_text(file_of(TRACE_FILE_VARIABLE, directory, TRACE_FILE_NAME)).c_str());
     std::printf("runAsRoot: %s\n", appliance_programs.c_str());
+    metrics_file metrics(metrics_path);
+    if (line.metrics != nullptr) {
+        std::printf("metrics: %s, after every pass\n", terminal_text(metrics_path).c_str());
+        library.observe(metrics_file::observe, &metrics);
+    }
     std::fflush(stdout);
 
     sleep_gate &g = gate();
@@ -582,8 +604,14 @@ int command_run(const command_line &line) {
         wait_for_monitor(signals.fd, ended.fd, g);
         monitor.join();
     } catch (const std::system_error &failure) {
+        if (line.metrics != nullptr) {
+            library.observe(nullptr, nullptr);
+        }
         std::fprintf(stderr, "tarnmon: cannot start the monitor's thread: %s\n", failure.what());
         return EXIT_UNAVAILABLE;
+    }
+    if (line.metrics != nullptr) {
+        library.observe(nullptr, nullptr);
     }
     {
         std::lock_guard hold(g.lock);

@@ -30,6 +30,7 @@ struct command_line {
     const char *data_dir = nullptr;
     const char *config = nullptr;
     const char *once = nullptr;
+    const char *metrics = nullptr; // the file of the figures of every pass
     // The limits of `limits`, in KB, as given; null when not given.
     const char *rss = nullptr;
     const char *dsiz = nullptr;

@@ -15,6 +15,7 @@ constexpr value_option RUN_OPTIONS[] = {
     {"--data-dir", "DIR", &command_line::data_dir},
     {"--config", "FILE", &command_line::config},
     {"--once", "", &command_line::once},
+    {"--metrics", "FILE", &command_line::metrics},
 };
 constexpr std::span<const value_option> NO_OPTIONS;
 // Taken by the commands that print what they found as a table or a listing; their --help says
@@ -59,7 +60,7 @@ constexpr command COMMANDS[] = {
      "run the monitor here until SIGINT, SIGTERM or tarnmon stop (--once: one pass)", 0, false,
      "run: 0 once the monitor has ended (its pass done, or stopped); check-config's status for a\n"
      "control file that check-config refuses; 1 the monitor returned a failure of its own; 3 also\n"
-     "no data directory, no library, or the control block in use\n"},
+     "no data directory, no library, the control block in use, or no metrics file to write\n"},
 };
 
 constexpr const char *EXIT_STATUSES =
