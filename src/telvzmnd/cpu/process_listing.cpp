@@ -574,7 +574,7 @@ TARN_EXPORT int print_process_list(process_list_header *list, char **out) {
     // per-process rows above them; readers of the table know them by that.
     emit_percentage_row(table, list, "user:   ", 6, user_sum);
     emit_percentage_row(table, list, "kernel: ", 7, kernel_sum);
-    int newest = ring_slot(list->current_sample + PROCESS_SAMPLES - 1);
+    int newest = ring_slot(ring_slot(list->current_sample) + PROCESS_SAMPLES - 1);
     note_appliance_cpu(user_sum[newest], kernel_sum[newest]);
     return tracesvc_trace("TARNCPUF: <-print_process_list");
 }
