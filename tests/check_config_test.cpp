@@ -52,8 +52,12 @@ TEST_F(CheckConfig, ExampleFileIsValid) {
     EXPECT_TRUE(contains(result.out, "VALID: the monitor would run with this control file"))
         << result.out;
     EXPECT_FALSE(contains(result.out, "PROBLEM")) << result.out;
-    EXPECT_TRUE(contains(result.out, "External checking routines: 1\n"
-                                     "  0: tarn_external_check1  resolved\n"))
+    EXPECT_TRUE(contains(result.out, "External checking routines: 5\n"
+                                     "  0: tarn_external_check1  resolved\n"
+                                     "  1: telvzextra_pressure  resolved\n"
+                                     "  2: telvzextra_oom_kills  resolved\n"
+                                     "  3: telvzextra_descriptors  resolved\n"
+                                     "  4: telvzextra_time_to_full  resolved\n"))
         << result.out;
 }
 
@@ -85,7 +89,7 @@ TEST_F(CheckConfig, PrintsEverySettingWithItsUnit) {
         contains(result.out, setting_line("CPU_SLEEP_TIME_THRESHOLD", "1100",
                                           "percent (x10) of the checking interval that a sleep may "
                                           "overrun") +
-                                 "\nExternal checking routines: 1\n"))
+                                 "\nExternal checking routines: 5\n"))
         << result.out;
     EXPECT_TRUE(contains(result.out, "Process log thresholds: 1\n  0: processes matching "
                                      "[appserver]  rss 1500000 KB  dsiz 0 KB  vsize 0 KB  "

@@ -38,7 +38,7 @@ expect_layout() {
   local root="$1"
   expect_file 755 "$root$bindir/tarnmon"
   local library
-  for library in libtelvzmnd.so libtelvplatform.so libtelvzjava.so; do
+  for library in libtelvzmnd.so libtelvplatform.so libtelvzjava.so libtelvzextra.so; do
     expect_file 644 "$root$libdir/$library"
   done
   local program

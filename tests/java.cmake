@@ -16,7 +16,11 @@ target_compile_definitions(java_host_test PRIVATE
   TARN_JAVA_CLASS_PATH="${TARN_JAR}:${TARN_TEST_JAR}"
   TARN_JAVA_NATIVE_LIBRARY="$<TARGET_FILE:telvzjava>")
 target_include_directories(java_host_test PRIVATE ${JNI_INCLUDE_DIRS})
-add_dependencies(java_host_test telvzjava telvzmnd_jar telvzmnd_test_jar tarnmon)
+add_dependencies(java_host_test telvzjava telvzmnd_jar telvzmnd_test_jar tarnmon telvzextra)
+# The example's module telvzextra is found beside the platform, from whose folder the loader
+# searches; a sanitizer's runtime makes every dlopen its own, so the loader searches from this
+# program instead, which must then name that folder too.
+set_target_properties(java_host_test PROPERTIES BUILD_RPATH "$<TARGET_FILE_DIR:telvzextra>")
 
 # The bridge's exported services, with the core's text helpers beside them.
 tarn_platform_test(java_bridge_test

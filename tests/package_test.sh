@@ -53,7 +53,7 @@ expect_layout "$scratch/root"
 { [ "$libexecdir" = /usr/libexec/telvzmnd ] && [ "$controlfile" = /etc/telvzmnd/telvzopt.trm ] &&
   [ "$unitdir" = /lib/systemd/system ]; } ||
   fail "the package's layout: $libexecdir $controlfile $unitdir"
-for file in "$bindir/tarnmon" "$libdir/libtelvzmnd.so" "$libdir/libtelvplatform.so" \
+for file in "$bindir/tarnmon" "$libdir/libtelvzmnd.so" "$libdir/libtelvplatform.so" "$libdir/libtelvzextra.so" \
   "$libdir/libtelvzjava.so" "$libexecdir/runAsRoot" "$controlfile" "$unitdir/telvzmnd.service"; do
   grep -q -E " \.${file//./\\.}\$" <<<"$listing" || fail "$file is not in the archive's list"
 done
