@@ -15,12 +15,17 @@
 
 #include "core/monitor_loop.h"
 #include "fake_commands.h"
+#include "monitor_on_the_platform.h"
 #include "platform_test_support.h"
 #include "private_ipc.h"
 #include "quiet_control_file.h"
 #include "quiet_host.h"
 
 namespace {
+
+using monitor_on_the_platform::as_traced;
+using monitor_on_the_platform::loaded;
+using monitor_on_the_platform::run_once;
 
 const std::string MODULE_PATH = std::string(TARN_LIBRARY_DIR) + "/libtelvzextra.so";
 
@@ -46,22 +51,6 @@ std::string control_text() {
     return quiet_control::text({{"SNAPSHOT_INTERVAL", "1"}}, lines);
 }
 
-std::string as_traced(const std::string &text) {
-    std::string traced;
-    for (char c : text) {
-        traced += c == '\n' ? "\\n" : c == '\r' ? "\\r" : std::string(1, c);
-    }
-    return traced;
-}
-
-bool loaded(const std::string &path) {
-    void *handle = dlopen(path.c_str(), RTLD_LAZY | RTLD_NOLOAD);
-    if (handle != nullptr) {
-        dlclose(handle);
-    }
-    return handle != nullptr;
-}
-
 class ExtraModuleOnThePlatform : public platform_test::PlatformTest {
   protected:
     void SetUp() override {
@@ -80,16 +69,6 @@ class ExtraModuleOnThePlatform : public platform_test::PlatformTest {
             private_ipc::remove_control_block_objects();
         }
         PlatformTest::TearDown();
-    }
-
-    uint32_t run_once() {
-        std::vector<std::string> words = {"telvzmnd", "60", "once"};
-        std::vector<char *> argv;
-        for (std::string &word : words) {
-            argv.push_back(word.data());
-        }
-        argv.push_back(nullptr);
-        return tarn_mon_main(static_cast<int32_t>(words.size()), argv.data());
     }
 
     bool key_is_ours = false;

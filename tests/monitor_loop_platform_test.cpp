@@ -20,6 +20,7 @@
 #include "core/monitor_loop.h"
 #include "fake_commands.h"
 #include "modsvc.h"
+#include "monitor_on_the_platform.h"
 #include "platform_test_support.h"
 #include "private_ipc.h"
 #include "quiet_control_file.h"
@@ -34,6 +35,10 @@
 // the trace file, so that the trace shows where in the run it came.
 
 namespace {
+
+using monitor_on_the_platform::as_traced;
+using monitor_on_the_platform::loaded;
+using monitor_on_the_platform::run_once;
 
 struct module_call {
     std::string module; // empty for a release
@@ -115,20 +120,6 @@ std::string framed(const std::string &name, const std::string &body) {
 }
 
 // A text as the trace file holds it: a line end inside a line is written as \n or \r.
-std::string as_traced(const std::string &text) {
-    std::string traced;
-    for (char c : text) {
-        if (c == '\n') {
-            traced += "\\n";
-        } else if (c == '\r') {
-            traced += "\\r";
-        } else {
-            traced += c;
-        }
-    }
-    return traced;
-}
-
 // `text` with every address ("0x" and hex digits) written as "<address>".
 std::string without_addresses(const std::string &text) {
     std::string plain;
@@ -170,14 +161,6 @@ bool is_date_line(const std::string &line) {
            std::find(std::begin(months), std::end(months), std::string(month)) != std::end(months);
 }
 
-bool loaded(const std::string &path) {
-    void *handle = dlopen(path.c_str(), RTLD_LAZY | RTLD_NOLOAD);
-    if (handle != nullptr) {
-        dlclose(handle);
-    }
-    return handle != nullptr;
-}
-
 class MonitorLoopOnThePlatform : public platform_test::PlatformTest {
   protected:
     void SetUp() override {
@@ -199,16 +182,6 @@ class MonitorLoopOnThePlatform : public platform_test::PlatformTest {
             private_ipc::remove_control_block_objects();
         }
         PlatformTest::TearDown();
-    }
-
-    uint32_t run_once() {
-        std::vector<std::string> words = {"telvzmnd", "60", "once"};
-        std::vector<char *> argv;
-        for (std::string &word : words) {
-            argv.push_back(word.data());
-        }
-        argv.push_back(nullptr);
-        return tarn_mon_main(static_cast<int32_t>(words.size()), argv.data());
     }
 
     // The texts of the trace file's lines, without the time, pid and thread id before them;
