@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <sched.h>
 #include <set>
 #include <string>
 #include <sys/ipc.h>
@@ -101,6 +102,47 @@ int semaphore_value(int id) {
 
 using private_ipc::start_child;
 using private_ipc::wait_child;
+
+// ---- A host's step before it starts the monitor ----
+
+// What a child in an IPC namespace of its own finds: 0 when the block's key got id 0, 1 when it got
+// another, 2 when the child cannot have a namespace of its own, 3 when no segment could be made.
+int block_id_in_a_fresh_namespace(bool kept_off_zero, bool key_taken_first) {
+    return wait_child(start_child([=] {
+        if (unshare(CLONE_NEWIPC) != 0) {
+            return 2;
+        }
+        int earlier = -1;
+        if (key_taken_first) {
+            earlier = shmget(static_cast<key_t>(TARN_CB_KEY), 16, IPC_CREAT | 0600);
+        }
+        if (kept_off_zero) {
+            keep_block_off_id_zero();
+        }
+        int id = shmget(static_cast<key_t>(TARN_CB_KEY), 16, IPC_CREAT | 0600);
+        if (key_taken_first && id != earlier) {
+            return 4; // the segment under the key was replaced
+        }
+        return id == -1 ? 3 : id == 0 ? 0 : 1;
+    }));
+}
+
+TEST(KeepBlockOffIdZero, BlockOfAFreshNamespaceGetsAnIdOtherThanZero) {
+    int unkept = block_id_in_a_fresh_namespace(false, false);
+    if (unkept == 2) {
+        GTEST_SKIP() << "a child cannot have an IPC namespace of its own here";
+    }
+    EXPECT_EQ(unkept, 0); // what the monitor would take for a failure
+    EXPECT_EQ(block_id_in_a_fresh_namespace(true, false), 1);
+}
+
+TEST(KeepBlockOffIdZero, SegmentUnderTheKeyIsLeftAsItIs) {
+    int found = block_id_in_a_fresh_namespace(true, true);
+    if (found == 2) {
+        GTEST_SKIP() << "a child cannot have an IPC namespace of its own here";
+    }
+    EXPECT_EQ(found, 0); // the key's segment, made first, keeps its id 0
+}
 
 class ControlBlock : public ::testing::Test {
   protected:

@@ -55,6 +55,7 @@ jint JNICALL monitor_main(JNIEnv *, jclass, jint checking_interval, jboolean one
     std::snprintf(interval, sizeof interval, "%d", static_cast<int>(checking_interval));
     char once[] = "once";
     char *argv[] = {program, interval, once, nullptr};
+    keep_block_off_id_zero();
     return static_cast<jint>(tarn_mon_main(one_pass_only != JNI_FALSE ? 3 : 2, argv));
 }
 

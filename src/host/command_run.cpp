@@ -251,10 +251,7 @@ class control_file_link {
 bool prepare_control_block_key() {
     int id = ::shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0);
     if (id == -1 && errno == ENOENT) {
-        int first = ::shmget(IPC_PRIVATE, 1, IPC_CREAT | 0600);
-        if (first != -1) {
-            ::shmctl(first, IPC_RMID, nullptr);
-        }
+        keep_block_off_id_zero();
         return true;
     }
     if (id == -1) {

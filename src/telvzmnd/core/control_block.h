@@ -4,8 +4,11 @@
 #pragma once
 
 #include <atomic>
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
+#include <sys/ipc.h>
+#include <sys/shm.h>
 
 #include "export.h"
 
@@ -136,6 +139,19 @@ extern int32_t shmid;                     // id of the segment; -1 until one is 
 extern control_block_pointer TARN_CB_PTR; // null until attached
 
 TARN_EXPORT uint32_t tarn_init(uint32_t *crc);
+
+// For a host about to start the monitor. The first segment of a fresh IPC namespace gets id 0,
+// and tarn_init takes a block of id 0 for a failure: while no segment stands under the block's
+// key, a segment made and removed here takes id 0, so that the block gets another. Inline: a
+// host's own step, which the library neither exports nor takes.
+inline void keep_block_off_id_zero() {
+    if (shmget(static_cast<key_t>(TARN_CB_KEY), 0, 0) == -1 && errno == ENOENT) {
+        int first = shmget(IPC_PRIVATE, 1, IPC_CREAT | 0600);
+        if (first != -1) {
+            shmctl(first, IPC_RMID, nullptr);
+        }
+    }
+}
 TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *crc);
 TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock);
 TARN_EXPORT void tarn_terminate_monitoring(void);
