@@ -129,14 +129,27 @@ void pressure_line(routine_text &text, const char *resource, const pressure_file
 
 EXTRA_EXPORT void telvzextra_pressure(const char *, char **returnedData) {
     routine_text text(returned, sizeof returned);
+    char buffers[RESOURCE_COUNT][FILE_SIZE];
+    file_text files[RESOURCE_COUNT];
+    bool none_present = true;
+    bool absence_to_say = false;
+    for (size_t i = 0; i < RESOURCE_COUNT; ++i) {
+        files[i] = read_proc_file(RESOURCES[i].file, buffers[i], sizeof buffers[i]);
+        none_present = none_present && !files[i].present;
+        absence_to_say = absence_to_say || (!files[i].present && !memories[i].absence_said);
+    }
+    // A kernel without pressure accounting, or with it off, has none of the files: one line.
+    if (none_present && absence_to_say) {
+        text.line("pressure: not available (no /proc/pressure: an old kernel, or pressure "
+                  "accounting off)");
+    }
     for (size_t i = 0; i < RESOURCE_COUNT; ++i) {
         const resource &each = RESOURCES[i];
         pressure_memory &memory = memories[i];
-        char buffer[FILE_SIZE];
-        file_text file = read_proc_file(each.file, buffer, sizeof buffer);
+        const file_text &file = files[i];
         pressure_file figures;
         if (!file.present) {
-            if (!memory.absence_said) {
+            if (!memory.absence_said && !none_present) {
                 text.line("pressure %s: not available (no /proc/%s: an old kernel, or pressure "
                           "accounting off)",
                           each.name, each.file);
