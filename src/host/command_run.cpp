@@ -398,6 +398,28 @@ bool load_library(monitor_library *library) {
 
 // ---- Running ----
 
+// The monitor's passes observed for as long as this lives: declared after what the observer
+// writes to, so that the observation ends before that goes.
+class observation {
+  public:
+    observation() = default;
+    observation(const observation &) = delete;
+    observation &operator=(const observation &) = delete;
+    ~observation() {
+        if (observe_ != nullptr) {
+            observe_(nullptr, nullptr);
+        }
+    }
+
+    void begin(observe_call observe, tarn_pass_observer observer, void *context) {
+        observe_ = observe;
+        observe_(observer, context);
+    }
+
+  private:
+    observe_call observe_ = nullptr;
+};
+
 // The monitor keeps some of what it allocates until its process ends: the expressions it compiled
 // from the control file, which it never gives back (it frees the rows that held them), and what
 // the C library's matcher caches in them. The leak checker of a sanitized build leaves the
@@ -578,9 +600,10 @@ int command_run(const command_line &line) {
                 terminal_text(file_of(TRACE_FILE_VARIABLE, directory, TRACE_FILE_NAME)).c_str());
     std::printf("runAsRoot: %s\n", appliance_programs.c_str());
     metrics_file metrics(metrics_path);
+    observation metrics_observed;
     if (line.metrics != nullptr) {
         std::printf("metrics: %s, after every pass\n", terminal_text(metrics_path).c_str());
-        library.observe(metrics_file::observe, &metrics);
+        metrics_observed.begin(library.observe, metrics_file::observe, &metrics);
     }
     std::fflush(stdout);
 
@@ -601,14 +624,8 @@ int command_run(const command_line &line) {
         wait_for_monitor(signals.fd, ended.fd, g);
         monitor.join();
     } catch (const std::system_error &failure) {
-        if (line.metrics != nullptr) {
-            library.observe(nullptr, nullptr);
-        }
         std::fprintf(stderr, "tarnmon: cannot start the monitor's thread: %s\n", failure.what());
         return EXIT_UNAVAILABLE;
-    }
-    if (line.metrics != nullptr) {
-        library.observe(nullptr, nullptr);
     }
     {
         std::lock_guard hold(g.lock);

@@ -185,13 +185,12 @@ int write_all(int fd, std::string_view text) {
     return 0;
 }
 
-// The name of the new file beside `path`: hidden, and not ending in ".prom", so that no collector
-// reads it half written.
-std::string new_file_pattern(const std::string &path) {
-    size_t slash = path.rfind('/');
-    std::string directory = slash == std::string::npos ? "." : path.substr(0, slash);
-    std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-    return directory + "/." + name + ".XXXXXX";
+// A new, empty file beside `path`, named in *name: hidden, and not ending in ".prom", so that no
+// collector reads it half written. Its descriptor, or -1 with errno set.
+int new_file_beside(const std::string &path, std::string *name) {
+    size_t after_slash = path.rfind('/') + 1; // 0 without a slash
+    *name = path.substr(0, after_slash) + "." + path.substr(after_slash) + ".XXXXXX";
+    return ::mkostemp(name->data(), O_CLOEXEC);
 }
 
 } // namespace
@@ -236,8 +235,8 @@ std::string metrics_text(const tarn_pass_figures &figures, const metrics_totals 
 }
 
 int replace_file(const std::string &path, std::string_view text) {
-    std::string name = new_file_pattern(path);
-    int fd = ::mkostemp(name.data(), O_CLOEXEC);
+    std::string name;
+    int fd = new_file_beside(path, &name);
     if (fd < 0) {
         return errno;
     }
@@ -278,8 +277,8 @@ int settle_replaceable_file(const std::string &path, std::string *absolute_path)
         return EISDIR;
     }
     // A new file is made and removed again, as every pass will make one.
-    std::string name = new_file_pattern(full);
-    int fd = ::mkostemp(name.data(), O_CLOEXEC);
+    std::string name;
+    int fd = new_file_beside(full, &name);
     if (fd < 0) {
         return errno;
     }

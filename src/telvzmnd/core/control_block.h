@@ -139,6 +139,9 @@ extern int32_t shmid;                     // id of the segment; -1 until one is 
 extern control_block_pointer TARN_CB_PTR; // null until attached
 
 TARN_EXPORT uint32_t tarn_init(uint32_t *crc);
+TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *crc);
+TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock);
+TARN_EXPORT void tarn_terminate_monitoring(void);
 
 // For a host about to start the monitor. The first segment of a fresh IPC namespace gets id 0,
 // and tarn_init takes a block of id 0 for a failure: while no segment stands under the block's
@@ -152,6 +155,3 @@ inline void keep_block_off_id_zero() {
         }
     }
 }
-TARN_EXPORT uint32_t tarn_init_tarn_cb_ptr(uint32_t *crc);
-TARN_EXPORT int32_t tarn_override_table_lock_control(int32_t lock);
-TARN_EXPORT void tarn_terminate_monitoring(void);

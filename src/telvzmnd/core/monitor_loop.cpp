@@ -64,9 +64,7 @@ struct monitor_run {
     int32_t keepRunning = 1;
     int32_t NumIterationsSinceLastSnapshot = 0;
     uint64_t passes = 0;
-    // The sleep before the pass, for the pass's figures: measured by its last second.
-    bool slept = false;
-    int32_t sleep_seconds = 0;
+    bool slept = false; // a second of the sleep before this pass was measured
     filesvc_handle_t handle = 0;
     tarn_control_block *block = nullptr;
 };
@@ -264,7 +262,7 @@ void publish_figures(const monitor_run &run, std::chrono::steady_clock::time_poi
     bool held_back = run.takeLogCrc == static_cast<int32_t>(TAKE_LOG_SUPPRESSED);
     publish_pass_figures(
         {static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(took).count()),
-         held_back ? 0 : run.takeLogCrc, held_back, run.slept, run.sleep_seconds,
+         held_back ? 0 : run.takeLogCrc, held_back, run.slept, telvzmnd_sleep_time,
          checking_interval});
 }
 
@@ -311,7 +309,6 @@ void run_pass(monitor_run &run) {
     }
     if (run.src == 0 && run.keepRunning == 1) {
         run.slept = sleep_measured(*run.block);
-        run.sleep_seconds = telvzmnd_sleep_time;
     }
 }
 

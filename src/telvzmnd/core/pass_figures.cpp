@@ -26,7 +26,9 @@ observation &observed() {
 tarn_partition_figures *find_partition(const char *mount_point) {
     for (uint32_t i = 0; i < figures.partition_count; ++i) {
         uint32_t at = (partition_cursor + i) % figures.partition_count;
-        if (std::strcmp(figures.partitions[at].mount_point, mount_point) == 0) {
+        // A mount point longer than the field is kept, and found, under its cut name.
+        if (std::strncmp(figures.partitions[at].mount_point, mount_point,
+                         TARN_MOUNT_POINT_SIZE - 1) == 0) {
             partition_cursor = (at + 1) % figures.partition_count;
             return &figures.partitions[at];
         }
@@ -66,12 +68,9 @@ void note_descriptor_share(int32_t tenths) {
 }
 
 void note_partition_use(bool space, const char *mount_point, int32_t tenths) {
-    // A mount point cut to fit is kept under its cut name, as the figures show it.
-    char name[TARN_MOUNT_POINT_SIZE];
-    std::snprintf(name, sizeof name, "%s", mount_point);
-    tarn_partition_figures *partition = find_partition(name);
+    tarn_partition_figures *partition = find_partition(mount_point);
     if (partition == nullptr) {
-        partition = add_partition(name);
+        partition = add_partition(mount_point);
     }
     if (partition != nullptr) {
         (space ? partition->space_tenths : partition->inodes_tenths) = tenths;
@@ -108,8 +107,4 @@ void publish_pass_figures(const pass_outcome &outcome) {
     if (o.observer != nullptr) {
         o.observer(&figures, o.context);
     }
-}
-
-const tarn_pass_figures &current_pass_figures() {
-    return figures;
 }

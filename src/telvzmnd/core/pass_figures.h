@@ -68,5 +68,3 @@ struct pass_outcome {
     int32_t sleep_interval;
 };
 void publish_pass_figures(const pass_outcome &outcome);
-// The figures noted so far in this pass, for tests.
-const tarn_pass_figures &current_pass_figures();
