@@ -47,7 +47,8 @@ void bare_vmstat() {
     bare_read("/proc/vmstat");
 }
 
-// Every process's limits and name read and its descriptors counted.
+// Every process's limits read and its descriptors counted; the routine reads the names of the
+// few it lists besides.
 void bare_descriptors() {
     DIR *proc = opendir("/proc");
     while (const dirent *entry = readdir(proc)) {
@@ -63,8 +64,6 @@ void bare_descriptors() {
             }
             closedir(fds);
         }
-        std::snprintf(path, sizeof path, "/proc/%s/comm", entry->d_name);
-        bare_read(path);
     }
     closedir(proc);
 }

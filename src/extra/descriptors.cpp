@@ -38,7 +38,9 @@ bool is_pid(const char *name) {
     return length > 0 && length < 20 && std::strspn(name, "0123456789") == length;
 }
 
-// Reads one process: skipped when it vanished, cannot be read, or gives a limit that is no number.
+// Reads one process's limit and count: skipped when it vanished, cannot be read, or gives a limit
+// that is no number. A process without a limit cannot run out, and its descriptors are not
+// counted. Its name is read only once it makes the list.
 reading read_process(const char *pid, descriptor_share *process) {
     char relative[64];
     std::snprintf(relative, sizeof relative, "%s/limits", pid);
@@ -46,17 +48,12 @@ reading read_process(const char *pid, descriptor_share *process) {
     file_text file = read_proc_file(relative, limits, sizeof limits);
     open_files_limit limit = file.present ? parse_open_files_limit(file.text)
                                           : open_files_limit{open_files_limit::malformed, 0};
-    if (limit.kind == open_files_limit::malformed || !count_descriptors(pid, &process->open)) {
-        return reading::skipped;
-    }
     if (limit.kind == open_files_limit::unlimited) {
         return reading::unlimited;
     }
-    std::snprintf(relative, sizeof relative, "%s/comm", pid);
-    char name[NAME_FILE_SIZE];
-    std::string_view comm = read_proc_file(relative, name, sizeof name).text;
-    comm.remove_suffix(comm.ends_with('\n') ? 1 : 0); // the kernel's line feed; any other shows
-    printable_copy(process->name, sizeof process->name, comm);
+    if (limit.kind == open_files_limit::malformed || !count_descriptors(pid, &process->open)) {
+        return reading::skipped;
+    }
     std::string_view digits = pid;
     take_number(digits, &process->pid);
     process->limit = limit.soft;
@@ -67,6 +64,15 @@ reading read_process(const char *pid, descriptor_share *process) {
 
 bool ranks_before(const descriptor_share &a, const descriptor_share &b) {
     return a.basis_points != b.basis_points ? a.basis_points > b.basis_points : a.pid < b.pid;
+}
+
+void read_name(const char *pid, descriptor_share *process) {
+    char relative[64];
+    std::snprintf(relative, sizeof relative, "%s/comm", pid);
+    char name[NAME_FILE_SIZE];
+    std::string_view comm = read_proc_file(relative, name, sizeof name).text;
+    comm.remove_suffix(comm.ends_with('\n') ? 1 : 0); // the kernel's line feed; any other shows
+    printable_copy(process->name, sizeof process->name, comm);
 }
 
 } // namespace
@@ -128,7 +134,9 @@ EXTRA_EXPORT void telvzextra_descriptors(const char *fileData, char **returnedDa
         descriptor_share process{};
         reading outcome = read_process(entry->d_name, &process);
         ++counts[static_cast<int>(outcome)];
-        if (outcome == reading::ranked) {
+        if (outcome == reading::ranked &&
+            (count < capacity || ranks_before(process, listed[count - 1]))) {
+            read_name(entry->d_name, &process);
             count = rank_process(listed, count, capacity, process);
         }
     }
